@@ -1,0 +1,72 @@
+// The system calls the library makes, behind one table of wrappers.
+//
+// Every open, read, write, attribute call and so on of the library goes through the functions
+// of namespace `sys`, never straight to the C library. Each wrapper counts its calls and can be
+// told to fail: tests arm a fault ("the 3rd pwrite fails with ENOSPC") and every error path of
+// the library can then be driven on a real file system, without mocks of whole components.
+#pragma once
+
+#include <sys/stat.h>
+#include <sys/statfs.h>
+#include <sys/types.h>
+#include <sys/time.h>
+
+#include <cstddef>
+#include <cstdint>
+
+namespace sys {
+
+// One entry per wrapped call; used to arm faults and to read call counts.
+enum class Call : int {
+  Open, Close, Read, Write, Pread, Pwrite, Ftruncate, Truncate,
+  Stat, Lstat, Fstat, Statfs, Fstatfs,
+  Getxattr, Lgetxattr, Fgetxattr, Setxattr, Lsetxattr, Fsetxattr,
+  Removexattr, Lremovexattr, Fremovexattr, Listxattr, Llistxattr, Flistxattr,
+  Futimes, Rename, Mkdir, Realpath, Malloc,
+  Count
+};
+
+int open(const char *path, int flags, mode_t mode);
+int close(int fd);
+ssize_t read(int fd, void *buffer, size_t count);
+ssize_t write(int fd, const void *buffer, size_t count);
+ssize_t pread(int fd, void *buffer, size_t count, off_t offset);
+ssize_t pwrite(int fd, const void *buffer, size_t count, off_t offset);
+int ftruncate(int fd, off_t length);
+int truncate(const char *path, off_t length);
+int stat(const char *path, struct ::stat *st);
+int lstat(const char *path, struct ::stat *st);
+int fstat(int fd, struct ::stat *st);
+int statfs(const char *path, struct ::statfs *st);
+int fstatfs(int fd, struct ::statfs *st);
+
+// Linux extended-attribute calls (no position, no options: see Platform/ExtendedAttributes.h).
+ssize_t getxattr(const char *path, const char *name, void *value, size_t size);
+ssize_t lgetxattr(const char *path, const char *name, void *value, size_t size);
+ssize_t fgetxattr(int fd, const char *name, void *value, size_t size);
+int setxattr(const char *path, const char *name, const void *value, size_t size, int flags);
+int lsetxattr(const char *path, const char *name, const void *value, size_t size, int flags);
+int fsetxattr(int fd, const char *name, const void *value, size_t size, int flags);
+int removexattr(const char *path, const char *name);
+int lremovexattr(const char *path, const char *name);
+int fremovexattr(int fd, const char *name);
+ssize_t listxattr(const char *path, char *list, size_t size);
+ssize_t llistxattr(const char *path, char *list, size_t size);
+ssize_t flistxattr(int fd, char *list, size_t size);
+
+int futimes(int fd, const struct timeval times[2]);
+int rename(const char *from, const char *to);
+int mkdir(const char *path, mode_t mode);
+char *realpath(const char *path, char *resolved);
+// malloc for the allocations whose failure the library reports (large buffers).
+void *malloc(size_t size);
+
+// Fault injection. `armFault(call, nth, error)` makes the nth call of that kind from now on
+// (1 = the next one) fail with `error`; with `sticky`, that call and every later one fail.
+// Counting and faults are process-wide and thread-safe.
+void armFault(Call call, uint64_t nth, int error, bool sticky = false);
+void clearFaults();
+// Number of calls of this kind made since the process started.
+uint64_t callCount(Call call);
+
+}  // namespace sys

@@ -1,0 +1,64 @@
+// Shared ground for the tests: scratch directories on a volume that holds large attributes,
+// capture of the diagnostics, and real volumes (loop-mounted ext4, small tmpfs) for tests that
+// need a file system that fails.
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace plzctest {
+
+// A fresh directory under $PLZC_TEST_DIR (or /dev/shm), removed with its contents on
+// destruction. Fails the test (ADD_FAILURE and an empty path) when that volume cannot hold
+// large attributes, with a message that says how to fix it.
+class ScratchDir {
+ public:
+  ScratchDir();
+  ~ScratchDir();
+  ScratchDir(const ScratchDir &) = delete;
+  ScratchDir &operator=(const ScratchDir &) = delete;
+  const std::string &path() const { return path_; }
+  // path() + "/" + name
+  std::string file(const std::string &name) const;
+
+ private:
+  std::string path_;
+};
+
+// Creates (or replaces) a file holding exactly these bytes; returns its path.
+std::string writeFile(const std::string &path, const std::vector<uint8_t> &bytes);
+std::string writeFile(const std::string &path, const std::string &text);
+std::vector<uint8_t> readFile(const std::string &path);
+// Deterministic pseudo-random bytes.
+std::vector<uint8_t> randomBytes(size_t count, uint32_t seed);
+
+// Names of every Linux extended attribute of the file (all namespaces the caller may see).
+std::vector<std::string> linuxAttributeNames(const std::string &path);
+
+// Runs a shell command and returns its standard output; *status gets the exit status.
+std::string runCommand(const std::string &command, int *status = nullptr);
+
+bool runningAsRoot();
+
+// A file system mounted on a fresh directory for the life of the object (root only):
+// an ext4 image without large-attribute support, or a tmpfs of the given size.
+class TemporaryMount {
+ public:
+  static TemporaryMount ext4WithoutLargeAttributes(const std::string &parentDir);
+  static TemporaryMount tmpfs(const std::string &parentDir, const std::string &size);
+  TemporaryMount(TemporaryMount &&other) noexcept;
+  ~TemporaryMount();
+  const std::string &mountPoint() const { return mountPoint_; }
+  bool mounted() const { return mounted_; }
+
+ private:
+  TemporaryMount() = default;
+  std::string mountPoint_;
+  std::string image_;
+  bool mounted_ = false;
+};
+
+}  // namespace plzctest
