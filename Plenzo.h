@@ -48,6 +48,48 @@ PLZC_EXPORT int queryCompressionInfo(const char *path, CompressionInfo *info);
  * gives 0 after a message). */
 PLZC_EXPORT int VolumeSupportsCompression(const char *path);
 
+/* ---- Type-5 request handler ----------------------------------------------------------- */
+
+/* The answer to one type-1 request: an opaque, reference-counted handle on that request's own
+ * 48-byte record and on the device it came from. Any thread may copy, invoke and release
+ * handles at any time, concurrently. A record and the device stay valid while any copy of a
+ * handle on it is held. */
+typedef struct Type5Completion Type5Completion;
+
+/* The caller's handlers of the requests of type5_handler_function, in this order. Both run on
+ * the loop's thread, which reads the next request only when the handler returns. Their results
+ * are ignored. A NULL entry handles its requests by doing nothing. */
+typedef struct Type5Callbacks {
+  /* Type-1 request. `completion` is lent for the duration of this call only: to answer after
+   * returning, keep Type5CompletionCopy(completion) and release that copy when done. Nothing
+   * is answered until a completion is invoked. */
+  int (*type1Handler)(uint64_t value1, uint64_t value2, uint64_t value3, uint64_t value4,
+                      Type5Completion *completion);
+  /* Type-2 request. When it returns, the request's 48 bytes are written back unchanged. */
+  int (*type2Handler)(uint64_t value1, uint64_t value2);
+} Type5Callbacks;
+
+/* Serves the kernel's type-5 device "/dev/plzc_type5" on the calling thread: reads 48-byte
+ * requests one at a time and hands each to `callbacks` by its type (1 or 2). Returns 0 when
+ * the loop ends: the device cannot be opened, a read fails (its record reads as type 0), or a
+ * request of any type but 1 and 2 arrives. NULL callbacks serve as two NULL entries.
+ * Diagnostics go to the system log at LOG_ERR only.
+ * The device is closed once the loop has ended and the last completion handle is released. */
+PLZC_EXPORT int type5_handler_function(const Type5Callbacks *callbacks);
+
+/* Returns `completion` with one more reference (NULL for NULL): a copy to keep past the
+ * handler's return. Every copy is given back with one Type5CompletionRelease. */
+PLZC_EXPORT Type5Completion *Type5CompletionCopy(Type5Completion *completion);
+
+/* Answers the request with one 48-byte write of its record with r1 at offset 16, r3 at offset
+ * 24 and r2 at offset 32; header, type and value4 stay as received. May be called any number
+ * of times, from any thread. Returns 0 when the 48 bytes were written, else -1 with errno
+ * (EINVAL for NULL) after logging "send response: ...". */
+PLZC_EXPORT int Type5CompletionInvoke(Type5Completion *completion, uint64_t r1, uint64_t r2, uint64_t r3);
+
+/* Gives back one reference; the last one frees the record. NULL does nothing. */
+PLZC_EXPORT void Type5CompletionRelease(Type5Completion *completion);
+
 #ifdef __cplusplus
 }
 #endif

@@ -1,0 +1,204 @@
+// The plain-file handle: a descriptor on a file on disk.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/time.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+
+#include "Common/Diagnostics.h"
+#include "Common/FileHandle.h"
+#include "Platform/ExtendedAttributes.h"
+#include "Platform/FileFlags.h"
+#include "Platform/Syscalls.h"
+
+static constexpr char kSourcePath[] = "Common/PlainFile";
+
+namespace {
+
+// The descriptor lives in the same allocation, right behind the record.
+struct PlainFile {
+  FileHandle handle;
+  int32_t fd;
+};
+
+int &descriptor(FileHandle *fh) { return *static_cast<int32_t *>(fh->priv); }
+
+int plainClose(FileHandle *fh) {
+  if (!fh) return 0;
+  int result = sys::close(descriptor(fh));
+  int savedErrno = errno;
+  free(fh->name);
+  free(fh->path);
+  delete reinterpret_cast<PlainFile *>(fh);
+  errno = savedErrno;
+  return result;
+}
+
+int plainReopen(FileHandle *fh, int openFlags) {
+  int fd = sys::open(fh->path, openFlags, 0666);
+  if (fd < 0) {
+    PLZC_ERR("%s:%d: open: %s\n", strerror(errno));
+    return -1;
+  }
+  sys::close(descriptor(fh));
+  descriptor(fh) = fd;
+  return 0;
+}
+
+uint16_t plainMode(FileHandle *fh) {
+  struct stat st;
+  if (sys::fstat(descriptor(fh), &st) != 0) {
+    PLZC_ERR("%s:%d: stat: %s\n", strerror(errno));
+    return 0;
+  }
+  return static_cast<uint16_t>(st.st_mode);
+}
+
+int plainTimes(FileHandle *fh, struct timespec times[2]) {
+  struct stat st;
+  if (sys::fstat(descriptor(fh), &st) != 0) {
+    PLZC_ERR("%s:%d: stat: %s\n", strerror(errno));
+    return -1;
+  }
+  times[0] = st.st_atim;
+  times[1] = st.st_mtim;
+  return 0;
+}
+
+int plainUtimes(FileHandle *fh, const struct timespec times[2]) {
+  struct timeval micro[2];
+  for (int i = 0; i < 2; i++) {
+    micro[i].tv_sec = times[i].tv_sec;
+    micro[i].tv_usec = times[i].tv_nsec / 1000;
+  }
+  if (sys::futimes(descriptor(fh), micro) != 0) {
+    PLZC_ERR("%s:%d: futimes: %s\n", strerror(errno));
+    return -1;
+  }
+  return 0;
+}
+
+int64_t plainSize(FileHandle *fh) {
+  struct stat st;
+  if (sys::fstat(descriptor(fh), &st) != 0) {
+    PLZC_ERR("%s:%d: stat: %s\n", strerror(errno));
+    return -1;
+  }
+  return st.st_size;
+}
+
+int64_t plainBlockSize(FileHandle *fh) {
+  struct stat st;
+  if (sys::fstat(descriptor(fh), &st) != 0) {
+    PLZC_ERR("%s:%d: stat: %s\n", strerror(errno));
+    return 4096;
+  }
+  return st.st_blksize;
+}
+
+int64_t plainPread(FileHandle *fh, void *buffer, int64_t count, int64_t offset) {
+  ssize_t got = sys::pread(descriptor(fh), buffer, static_cast<size_t>(count), offset);
+  if (got < 0) PLZC_ERR("%s:%d: pread: %s\n", strerror(errno));
+  return got;
+}
+
+int64_t plainPwrite(FileHandle *fh, const void *buffer, int64_t count, int64_t offset) {
+  ssize_t put = sys::pwrite(descriptor(fh), buffer, static_cast<size_t>(count), offset);
+  if (put < 0) PLZC_ERR("%s:%d: pwrite: %s\n", strerror(errno));
+  return put;
+}
+
+// The flag, truncation and attribute operations act on the path, whatever the descriptor's
+// open mode.
+int plainChflags(FileHandle *fh, uint32_t flags) {
+  if (platform::chflags(fh->path, flags) != 0) {
+    PLZC_ERR("%s:%d: chflags: %s\n", strerror(errno));
+    return -1;
+  }
+  return 0;
+}
+
+int plainTruncate(FileHandle *fh, int64_t length) {
+  if (sys::truncate(fh->path, length) != 0) {
+    PLZC_ERR("%s:%d: truncate: %s\n", strerror(errno));
+    return -1;
+  }
+  return 0;
+}
+
+int64_t plainGetxattr(FileHandle *fh, const char *name, void *buffer, uint64_t size, uint32_t position,
+                      int options) {
+  ssize_t got = platform::getxattr(fh->path, name, buffer, size, position, options);
+  if (got < 0 && errno != ENOATTR) PLZC_ERR("%s:%d: getxattr: %s\n", strerror(errno));
+  return got;
+}
+
+int plainSetxattr(FileHandle *fh, const char *name, const void *buffer, uint64_t size, uint32_t position,
+                  int options) {
+  if (platform::setxattr(fh->path, name, buffer, size, position, options) != 0) {
+    PLZC_ERR("%s:%d: fsetxattr: %s\n", strerror(errno));
+    return -1;
+  }
+  return 0;
+}
+
+int plainRemovexattr(FileHandle *fh, const char *name, int options) {
+  if (platform::removexattr(fh->path, name, options) != 0) {
+    if (errno != ENOATTR) PLZC_ERR("%s:%d: removexattr(%s,%s): %s\n", fh->path, name, strerror(errno));
+    return -1;
+  }
+  return 0;
+}
+
+const FileHandle kPlainFileTemplate = {
+    .name = nullptr,
+    .path = nullptr,
+    .canUnread = 0,
+    .close = plainClose,
+    .reopen = plainReopen,
+    .mode = plainMode,
+    .times = plainTimes,
+    .utimes = plainUtimes,
+    .size = plainSize,
+    .blockSize = plainBlockSize,
+    .pread = plainPread,
+    .pwrite = plainPwrite,
+    .unreadAlloc = nullptr,
+    .unreadSetPos = nullptr,
+    .unread = nullptr,
+    .unreadDone = nullptr,
+    .chflags = plainChflags,
+    .truncate = plainTruncate,
+    .getxattr = plainGetxattr,
+    .setxattr = plainSetxattr,
+    .removexattr = plainRemovexattr,
+    .priv = nullptr,
+};
+
+}  // namespace
+
+FileHandle *openFile(const char *name, const char *path, int oflag) {
+  int fd = sys::open(path, oflag, 0666);
+  if (fd < 0) {
+    PLZC_ERR("%s:%d: open %s: %s\n", path, strerror(errno));
+    return nullptr;
+  }
+  auto *file = new (std::nothrow) PlainFile{kPlainFileTemplate, fd};
+  char *nameCopy = strdup(name);
+  char *pathCopy = strdup(path);
+  if (!file || !nameCopy || !pathCopy) {
+    sys::close(fd);
+    delete file;
+    free(nameCopy);
+    free(pathCopy);
+    errno = ENOMEM;
+    return nullptr;
+  }
+  file->handle.name = nameCopy;
+  file->handle.path = pathCopy;
+  file->handle.priv = &file->fd;
+  return &file->handle;
+}

@@ -1,0 +1,306 @@
+#include "Platform/ExtendedAttributes.h"
+
+#include <fcntl.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cstring>
+#include <random>
+#include <thread>
+
+#include "Platform/Syscalls.h"
+#include "Support/TestSupport.h"
+
+using namespace plzctest;
+
+namespace {
+
+constexpr const char *kFork = PLZC_RESOURCE_FORK_NAME;
+constexpr size_t kPiece = 65536;
+
+class ExtendedAttributes : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_FALSE(dir.path().empty());
+    path = writeFile(dir.file("file"), std::string("data fork"));
+  }
+  void TearDown() override { sys::clearFaults(); }
+
+  std::vector<uint8_t> readAll(const char *name) {
+    ssize_t size = platform::getxattr(path.c_str(), name, nullptr, 0, 0, 0);
+    EXPECT_GE(size, 0) << strerror(errno);
+    std::vector<uint8_t> value(static_cast<size_t>(std::max<ssize_t>(size, 0)));
+    EXPECT_EQ(platform::getxattr(path.c_str(), name, value.data(), value.size(), 0, 0), size);
+    return value;
+  }
+
+  void writePiece(const std::vector<uint8_t> &source, size_t offset, size_t length) {
+    ASSERT_EQ(platform::setxattr(path.c_str(), kFork, source.data() + offset, length, offset, 0), 0)
+        << "offset " << offset << ": " << strerror(errno);
+  }
+
+  // Reads windows of the fork at positions spread over the whole value and across segment
+  // boundaries, comparing with the model.
+  void expectWindowsMatch(const std::vector<uint8_t> &model) {
+    std::mt19937 generator(7);
+    std::vector<uint8_t> window(kPiece + 3);
+    std::vector<size_t> positions = {0, 1, kPiece - 1, kPiece, kPiece + 1, model.size() - 1, model.size() - 8};
+    for (int i = 0; i < 40; i++) positions.push_back(generator() % model.size());
+    for (size_t position : positions) {
+      for (size_t length : {size_t(1), size_t(8), size_t(4096), window.size()}) {
+        ssize_t got = platform::getxattr(path.c_str(), kFork, window.data(), length, static_cast<uint32_t>(position), 0);
+        size_t expected = std::min(length, model.size() - position);
+        ASSERT_EQ(got, static_cast<ssize_t>(expected)) << "at " << position;
+        ASSERT_TRUE(std::equal(window.begin(), window.begin() + got, model.begin() + position)) << "at " << position;
+      }
+    }
+  }
+
+  ScratchDir dir;
+  std::string path;
+};
+
+TEST_F(ExtendedAttributes, LargeForkWrittenInOrderReadsBackAtAnyPosition) {
+  std::vector<uint8_t> fork = randomBytes(16 * 1024 * 1024 + 1, 1);
+  for (size_t offset = 0; offset < fork.size(); offset += kPiece)
+    writePiece(fork, offset, std::min(kPiece, fork.size() - offset));
+
+  EXPECT_EQ(platform::getxattr(path.c_str(), kFork, nullptr, 0, 0, 0), static_cast<ssize_t>(fork.size()));
+  EXPECT_EQ(readAll(kFork), fork);
+  expectWindowsMatch(fork);
+  // Reading at or past the end gives nothing.
+  uint8_t byte;
+  EXPECT_EQ(platform::getxattr(path.c_str(), kFork, &byte, 1, static_cast<uint32_t>(fork.size()), 0), 0);
+}
+
+TEST_F(ExtendedAttributes, LargeForkWrittenInRandomOrderWithOverlapsAndGaps) {
+  const size_t size = 16 * 1024 * 1024 + 1;
+  std::vector<uint8_t> model(size, 0);
+  std::vector<uint8_t> source = randomBytes(size, 2);
+  std::vector<size_t> offsets;
+  // Every piece but a few (those stay gaps), shifted so that neighbours overlap.
+  for (size_t offset = 0; offset < size; offset += kPiece)
+    if ((offset / kPiece) % 37 != 5) offsets.push_back(offset);
+  std::shuffle(offsets.begin(), offsets.end(), std::mt19937(3));
+  for (size_t offset : offsets) {
+    size_t start = offset >= 1000 ? offset - 1000 : offset;  // overlaps the previous piece
+    size_t length = std::min(kPiece + 1000, size - start);
+    std::vector<uint8_t> piece = randomBytes(length, static_cast<uint32_t>(offset));
+    ASSERT_EQ(platform::setxattr(path.c_str(), kFork, piece.data(), length, static_cast<uint32_t>(start), 0), 0);
+    std::copy(piece.begin(), piece.end(), model.begin() + start);
+  }
+  // The last byte is always written, so the length is the full size.
+  EXPECT_EQ(platform::getxattr(path.c_str(), kFork, nullptr, 0, 0, 0), static_cast<ssize_t>(size));
+  EXPECT_EQ(readAll(kFork), model);
+  expectWindowsMatch(model);
+}
+
+TEST_F(ExtendedAttributes, GapsReadAsZerosAndTheValueNeverShrinks) {
+  std::vector<uint8_t> tail = randomBytes(100, 4);
+  const uint32_t far = 3 * kPiece + 17;
+  ASSERT_EQ(platform::setxattr(path.c_str(), kFork, tail.data(), tail.size(), far, 0), 0);
+  std::vector<uint8_t> head = {1, 2, 3};
+  ASSERT_EQ(platform::setxattr(path.c_str(), kFork, head.data(), head.size(), 0, 0), 0);
+
+  std::vector<uint8_t> expected(far + tail.size(), 0);
+  std::copy(head.begin(), head.end(), expected.begin());
+  std::copy(tail.begin(), tail.end(), expected.begin() + far);
+  EXPECT_EQ(readAll(kFork), expected);
+}
+
+TEST_F(ExtendedAttributes, SmallValueIsAnOrdinaryLinuxAttribute) {
+  const std::string value = "fpmc header bytes";
+  ASSERT_EQ(platform::setxattr(path.c_str(), "com.tavix.decmpfs", value.data(), value.size(), 0, 0), 0);
+  int status;
+  std::string shown = runCommand("getfattr --only-values -n user.com.tavix.decmpfs '" + path + "'", &status);
+  EXPECT_EQ(status, 0);
+  EXPECT_EQ(shown, value);
+  // And an attribute another tool set is read back unchanged.
+  ASSERT_EQ(setxattr(path.c_str(), "user.other", "xyz", 3, 0), 0);
+  char buffer[8];
+  EXPECT_EQ(platform::getxattr(path.c_str(), "other", buffer, sizeof buffer, 0, 0), 3);
+  EXPECT_EQ(std::string(buffer, 3), "xyz");
+}
+
+TEST_F(ExtendedAttributes, RemovalLeavesNoLinuxAttributeBehind) {
+  std::vector<uint8_t> fork = randomBytes(5 * kPiece + 123, 5);
+  writePiece(fork, 0, fork.size());
+  ASSERT_EQ(platform::setxattr(path.c_str(), "small", "v", 1, 0, 0), 0);
+  ASSERT_GT(linuxAttributeNames(path).size(), 2u);
+
+  EXPECT_EQ(platform::removexattr(path.c_str(), kFork, 0), 0);
+  EXPECT_EQ(platform::removexattr(path.c_str(), "small", 0), 0);
+  EXPECT_TRUE(linuxAttributeNames(path).empty());
+  EXPECT_EQ(runCommand("getfattr -d -m - '" + path + "' 2>&1"), "");
+
+  EXPECT_EQ(platform::removexattr(path.c_str(), kFork, 0), -1);
+  EXPECT_EQ(errno, ENOATTR);
+}
+
+TEST_F(ExtendedAttributes, RenameKeepsEverything) {
+  std::vector<uint8_t> fork = randomBytes(3 * kPiece + 5, 6);
+  writePiece(fork, 0, fork.size());
+  std::string renamed = dir.file("renamed");
+  ASSERT_EQ(rename(path.c_str(), renamed.c_str()), 0);
+  path = renamed;
+  EXPECT_EQ(readAll(kFork), fork);
+}
+
+TEST_F(ExtendedAttributes, ReadingEightBytesTouchesAtMostTwoSegments) {
+  std::vector<uint8_t> fork = randomBytes(64 * kPiece, 8);
+  writePiece(fork, 0, fork.size());
+  uint8_t bytes[8];
+  for (size_t position : {size_t(0), kPiece - 4, kPiece - 8, 10 * kPiece + 3, fork.size() - 8}) {
+    platform::xattrSegmentCounters() = {};
+    ASSERT_EQ(platform::getxattr(path.c_str(), kFork, bytes, 8, static_cast<uint32_t>(position), 0), 8);
+    EXPECT_TRUE(std::equal(bytes, bytes + 8, fork.begin() + position));
+    EXPECT_LE(platform::xattrSegmentCounters().reads, 2u) << "at " << position;
+    EXPECT_GE(platform::xattrSegmentCounters().reads, 1u);
+  }
+}
+
+TEST_F(ExtendedAttributes, WholeReplacementSwitchesBetweenFormsWithoutLeftovers) {
+  std::vector<uint8_t> large = randomBytes(4 * kPiece + 9, 9), larger = randomBytes(7 * kPiece, 10);
+  std::vector<uint8_t> small = {9, 8, 7};
+  ASSERT_EQ(platform::setxattr(path.c_str(), "value", large.data(), large.size(), 0, 0), 0);
+  EXPECT_EQ(readAll("value"), large);
+  ASSERT_EQ(platform::setxattr(path.c_str(), "value", larger.data(), larger.size(), 0, 0), 0);
+  EXPECT_EQ(readAll("value"), larger);
+  EXPECT_EQ(linuxAttributeNames(path).size(), 1u + 7u);  // index and seven segments
+  ASSERT_EQ(platform::setxattr(path.c_str(), "value", small.data(), small.size(), 0, 0), 0);
+  EXPECT_EQ(readAll("value"), small);
+  EXPECT_EQ(linuxAttributeNames(path), std::vector<std::string>{"user.value"});
+  ASSERT_EQ(platform::setxattr(path.c_str(), "value", large.data(), large.size(), 0, 0), 0);
+  EXPECT_EQ(readAll("value"), large);
+  EXPECT_EQ(linuxAttributeNames(path).size(), 1u + 5u);
+}
+
+TEST_F(ExtendedAttributes, FailedReplacementKeepsThePreviousValue) {
+  std::vector<uint8_t> old = randomBytes(3 * kPiece, 11), replacement = randomBytes(6 * kPiece, 12);
+  ASSERT_EQ(platform::setxattr(path.c_str(), "value", old.data(), old.size(), 0, 0), 0);
+  std::vector<std::string> namesBefore = linuxAttributeNames(path);
+  // Fail each of the calls a replacement makes in turn: segments, then the index.
+  for (uint64_t nth = 1; nth <= 7; nth++) {
+    sys::armFault(sys::Call::Setxattr, nth, ENOSPC);
+    ASSERT_EQ(platform::setxattr(path.c_str(), "value", replacement.data(), replacement.size(), 0, 0), -1);
+    EXPECT_EQ(errno, ENOSPC);
+    sys::clearFaults();
+    EXPECT_EQ(readAll("value"), old) << "failure at call " << nth;
+    auto namesAfter = linuxAttributeNames(path);
+    std::sort(namesAfter.begin(), namesAfter.end());
+    std::sort(namesBefore.begin(), namesBefore.end());
+    EXPECT_EQ(namesAfter, namesBefore) << "failure at call " << nth;
+  }
+}
+
+TEST_F(ExtendedAttributes, ReaderSeesOldOrNewValueNeverAMix) {
+  std::vector<uint8_t> a(5 * kPiece, 'a'), b(5 * kPiece + 10, 'b');
+  ASSERT_EQ(platform::setxattr(path.c_str(), "value", a.data(), a.size(), 0, 0), 0);
+  std::atomic<bool> done{false};
+  std::thread writer([&] {
+    for (int i = 0; i < 200; i++) {
+      const auto &next = (i % 2) ? a : b;
+      ASSERT_EQ(platform::setxattr(path.c_str(), "value", next.data(), next.size(), 0, 0), 0);
+    }
+    done = true;
+  });
+  std::vector<uint8_t> buffer(b.size());
+  int reads = 0;
+  while (!done) {
+    ssize_t got = platform::getxattr(path.c_str(), "value", buffer.data(), buffer.size(), 0, 0);
+    ASSERT_TRUE(got == static_cast<ssize_t>(a.size()) || got == static_cast<ssize_t>(b.size()))
+        << got << " " << strerror(errno);
+    uint8_t first = buffer[0];
+    ASSERT_TRUE(std::all_of(buffer.begin(), buffer.begin() + got, [&](uint8_t c) { return c == first; }));
+    ASSERT_EQ(got, static_cast<ssize_t>(first == 'a' ? a.size() : b.size()));
+    reads++;
+  }
+  writer.join();
+  EXPECT_GT(reads, 0);
+}
+
+TEST_F(ExtendedAttributes, ArgumentsAndOptionsBehaveAsDocumented) {
+  char buffer[16];
+  std::vector<uint8_t> big = randomBytes(2 * kPiece, 13);
+  struct Case {
+    const char *what;
+    int result;
+    int error;
+  };
+  auto check = [](const Case &c, int result) {
+    EXPECT_EQ(result, c.result) << c.what;
+    if (c.result == -1) {
+      EXPECT_EQ(errno, c.error) << c.what;
+    }
+  };
+  const char *p = path.c_str();
+  check({"position on an ordinary attribute", -1, EINVAL}, platform::setxattr(p, "x", "a", 1, 5, 0));
+  check({"create", 0, 0}, platform::setxattr(p, "x", "abc", 3, 0, kXattrCreate));
+  check({"create again", -1, EEXIST}, platform::setxattr(p, "x", "abc", 3, 0, kXattrCreate));
+  check({"replace missing", -1, ENOATTR}, platform::setxattr(p, "y", "a", 1, 0, kXattrReplace));
+  check({"replace existing", 0, 0}, platform::setxattr(p, "x", "abcd", 4, 0, kXattrReplace));
+  check({"create and replace", -1, EINVAL}, platform::setxattr(p, "x", "a", 1, 0, kXattrCreate | kXattrReplace));
+  check({"unknown option", -1, EINVAL}, static_cast<int>(platform::getxattr(p, "x", buffer, 16, 0, 0x100)));
+  check({"show compression", 4, 0}, static_cast<int>(platform::getxattr(p, "x", buffer, 16, 0, kXattrShowCompression)));
+  check({"buffer too small", -1, ERANGE}, static_cast<int>(platform::getxattr(p, "x", buffer, 2, 0, 0)));
+  check({"read position on ordinary", -1, EINVAL}, static_cast<int>(platform::getxattr(p, "x", buffer, 16, 1, 0)));
+  check({"missing", -1, ENOATTR}, static_cast<int>(platform::getxattr(p, "nothing", buffer, 16, 0, 0)));
+  check({"reserved name read", -1, ENOATTR}, static_cast<int>(platform::getxattr(p, "plzc#flags", buffer, 16, 0, 0)));
+  check({"reserved name write", -1, EINVAL}, platform::setxattr(p, "plzc#x#i", "a", 1, 0, 0));
+  check({"name too long", -1, ENAMETOOLONG}, platform::setxattr(p, std::string(128, 'n').c_str(), "a", 1, 0, 0));
+  check({"large create", 0, 0}, platform::setxattr(p, "big", big.data(), big.size(), 0, kXattrCreate));
+  check({"large create again", -1, EEXIST}, platform::setxattr(p, "big", big.data(), big.size(), 0, kXattrCreate));
+
+  // Listing shows values by their names, segmented or not, and never the reserved names.
+  char names[256];
+  ssize_t length = platform::listxattr(p, names, sizeof names, 0);
+  ASSERT_GT(length, 0);
+  std::vector<std::string> listed;
+  for (ssize_t at = 0; at < length; at += static_cast<ssize_t>(listed.back().size()) + 1) listed.emplace_back(names + at);
+  EXPECT_EQ(listed, (std::vector<std::string>{"big", "x"}));
+  EXPECT_EQ(platform::listxattr(p, nullptr, 0, 0), length);
+  EXPECT_EQ(platform::listxattr(p, names, 3, 0), -1);
+  EXPECT_EQ(errno, ERANGE);
+}
+
+TEST_F(ExtendedAttributes, DescriptorCallsMatchPathCalls) {
+  int fd = open(path.c_str(), O_RDONLY);
+  ASSERT_GE(fd, 0);
+  std::vector<uint8_t> fork = randomBytes(2 * kPiece + 77, 14);
+  ASSERT_EQ(platform::fsetxattr(fd, kFork, fork.data(), kPiece, 0, 0), 0);
+  ASSERT_EQ(platform::fsetxattr(fd, kFork, fork.data() + kPiece, fork.size() - kPiece, kPiece, 0), 0);
+  EXPECT_EQ(readAll(kFork), fork);
+  std::vector<uint8_t> back(fork.size());
+  EXPECT_EQ(platform::fgetxattr(fd, kFork, back.data(), back.size(), 0, 0), static_cast<ssize_t>(fork.size()));
+  EXPECT_EQ(back, fork);
+  EXPECT_EQ(platform::fgetxattr(fd, kFork, back.data(), 1, 0, kXattrNoFollow), -1);
+  EXPECT_EQ(errno, EINVAL);
+  EXPECT_EQ(platform::fremovexattr(fd, kFork, 0), 0);
+  EXPECT_TRUE(linuxAttributeNames(path).empty());
+  close(fd);
+}
+
+TEST(ExtendedAttributesOnExt4, LargeForkFailsWithTheFileSystemErrorAndKeepsThePreviousValue) {
+  if (!runningAsRoot()) GTEST_SKIP() << "mounting a file system needs root";
+  ScratchDir dir;
+  TemporaryMount ext4 = TemporaryMount::ext4WithoutLargeAttributes(dir.path());
+  ASSERT_TRUE(ext4.mounted());
+  std::string path = writeFile(ext4.mountPoint() + "/file", std::string("x"));
+  std::vector<uint8_t> previous = randomBytes(200, 15), fork = randomBytes(4 * kPiece, 16);
+  ASSERT_EQ(platform::setxattr(path.c_str(), kFork, previous.data(), previous.size(), 0, 0), 0);
+
+  EXPECT_EQ(platform::setxattr(path.c_str(), kFork, fork.data(), fork.size(), 0, 0), -1);
+  EXPECT_EQ(errno, ENOSPC);
+  std::vector<uint8_t> back(previous.size() + 10);
+  ASSERT_EQ(platform::getxattr(path.c_str(), kFork, back.data(), back.size(), 0, 0),
+            static_cast<ssize_t>(previous.size()));
+  back.resize(previous.size());
+  EXPECT_EQ(back, previous);
+  EXPECT_EQ(linuxAttributeNames(path), std::vector<std::string>{"user.com.tavix.ResourceFork"});
+}
+
+}  // namespace
