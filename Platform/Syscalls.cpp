@@ -111,6 +111,8 @@ int rename(const char *from, const char *to) { PLZC_WRAP(Rename, -1, ::rename(fr
 int mkdir(const char *path, mode_t mode) { PLZC_WRAP(Mkdir, -1, ::mkdir(path, mode)); }
 char *realpath(const char *path, char *resolved) { PLZC_WRAP(Realpath, nullptr, ::realpath(path, resolved)); }
 void *malloc(size_t size) { PLZC_WRAP(Malloc, nullptr, ::malloc(size)); }
+void *calloc(size_t count, size_t size) { PLZC_WRAP(Calloc, nullptr, ::calloc(count, size)); }
+int dup(int fd) { PLZC_WRAP(Dup, -1, ::dup(fd)); }
 
 #undef PLZC_WRAP
 

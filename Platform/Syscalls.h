@@ -22,7 +22,7 @@ enum class Call : int {
   Stat, Lstat, Fstat, Statfs, Fstatfs,
   Getxattr, Lgetxattr, Fgetxattr, Setxattr, Lsetxattr, Fsetxattr,
   Removexattr, Lremovexattr, Fremovexattr, Listxattr, Llistxattr, Flistxattr,
-  Futimes, Rename, Mkdir, Realpath, Malloc,
+  Futimes, Rename, Mkdir, Realpath, Malloc, Calloc, Dup,
   Count
 };
 
@@ -60,6 +60,8 @@ int mkdir(const char *path, mode_t mode);
 char *realpath(const char *path, char *resolved);
 // malloc for the allocations whose failure the library reports (large buffers).
 void *malloc(size_t size);
+void *calloc(size_t count, size_t size);
+int dup(int fd);
 
 // Fault injection. `armFault(call, nth, error)` makes the nth call of that kind from now on
 // (1 = the next one) fail with `error`; with `sticky`, that call and every later one fail.
