@@ -14,6 +14,7 @@
 #ifndef PLENZO_H
 #define PLENZO_H
 
+#include <stdbool.h>
 #include <stdint.h>
 
 #ifdef __cplusplus
@@ -47,6 +48,79 @@ PLZC_EXPORT int queryCompressionInfo(const char *path, CompressionInfo *info);
 /* Returns 1 when the volume holding path can store compressed files, else 0 (every failure
  * gives 0 after a message). */
 PLZC_EXPORT int VolumeSupportsCompression(const char *path);
+
+/* ---- Compressor context --------------------------------------------------------------- */
+
+/* The caller's choices for a series of compressions: types to try, zlib level, checksums,
+ * in place or into a table-of-contents file; and statistics of what was done. */
+typedef struct CompressorContext CompressorContext;
+
+/* Builds a context from compressorList, comma-separated type numbers tried in that order
+ * ("3,4" or "4"). initArg1 and initArg2 are handed to every type's set-up (pass NULL). With
+ * tocPath, files are left unchanged and their compressed attributes appended to that file
+ * (created with its directories, truncated); with NULL, files are compressed in place.
+ * Returns the context, or NULL with errno: an unknown or empty type prints a message per bad
+ * entry, then "error setting up compressor list". Release it with freeCompressor. */
+PLZC_EXPORT CompressorContext *initCompressor(const char *compressorList, void *initArg1, void *initArg2,
+                                              const char *tocPath, bool verifyChecksums, int32_t compressionLevel,
+                                              bool allowLargeResourceForks);
+
+/* Releases the context and closes its table-of-contents file. NULL is ignored. No other
+ * thread may be using it. */
+PLZC_EXPORT void freeCompressor(CompressorContext *ctx);
+
+/* ---- Whole-file compression --------------------------------------------------------- */
+
+/* A handle on a file's data and attributes (see openTocFile); opaque to callers. */
+typedef struct FileHandle FileHandle;
+
+/* Compresses one file with the context's types, tried in order until one takes it. fh is a
+ * handle open on the file, or NULL to open path read-only for the call. In place, the data fork
+ * is then truncated, the times restored and the flags set to the compressed flag; in
+ * table-of-contents mode the file is untouched and its compressed attributes appended to the
+ * context's file. Returns 0 when compressed, and when there was nothing to do (empty, or
+ * already has "com.tavix.decmpfs"); -1 when no type took it (a file with its own resource fork
+ * is refused) or a step failed. Safe on many threads with one context. */
+PLZC_EXPORT int compressFile(CompressorContext *ctx, const char *path, FileHandle *fh);
+
+/* ---- Decompression and reading -------------------------------------------------------- */
+
+/* Turns the compressed file at path back into a plain file in place: its data fork holds the
+ * logical data, both compression attributes are removed, times, mode and the other flags are
+ * as before. With verify, the logical data is checksummed before and compared after. The
+ * library decompresses itself (the Linux kernel never does; forceUserSpace forces it where a
+ * kernel could). Returns 0, also for a file that is not compressed; -1 after a message. */
+PLZC_EXPORT int decompressFile(const char *path, bool verify, int forceUserSpace);
+
+/* Writes the logical data of the file at path to standard output, decompressing when it is
+ * compressed. Failures are reported on standard error only. */
+PLZC_EXPORT void catFile(const char *path, int forceUserSpace);
+
+/* ---- File enumerators ------------------------------------------------------------------ */
+
+/* Yields regular files one at a time, a file with several hard links once, under the first
+ * path met (later paths print "already visited %s as %s"). The directory kind walks a tree
+ * without following symbolic links or crossing into other file systems; the list kind reads a
+ * text file of paths, one per line. */
+typedef struct FileEnumerator FileEnumerator;
+
+/* Starts a walk of the tree at path; NULL after a message. */
+PLZC_EXPORT FileEnumerator *initFileEnumeratorFromDir(const char *path);
+/* Stores the next file's path (owned by the enumerator, valid until the next call) in *pathOut
+ * and returns 1; 0 when the walk is over. */
+PLZC_EXPORT int enumFilesFromDir(FileEnumerator *enumerator, const char **pathOut);
+/* Ends the walk and frees the enumerator; NULL is ignored. */
+PLZC_EXPORT void freeFileEnumeratorFromDir(FileEnumerator *enumerator);
+
+/* Starts reading the list file at listPath; each line is a path, examined under prefix (a
+ * directory, or NULL for the lines as they stand). Lines of 1028 bytes or more are reported
+ * and skipped. NULL after a message. */
+PLZC_EXPORT FileEnumerator *initFileEnumeratorFromFileList(const char *listPath, const char *prefix);
+/* Stores the next line naming a regular file (as written, without the prefix) in *pathOut and
+ * returns 1; 0 at the end of the list. Lines that name nothing usable are reported and skipped. */
+PLZC_EXPORT int enumFilesFromFileList(FileEnumerator *enumerator, const char **pathOut);
+/* Releases the list and frees the enumerator; NULL is ignored. */
+PLZC_EXPORT void freeFileEnumeratorFromFileList(FileEnumerator *enumerator);
 
 /* ---- Type-5 request handler ----------------------------------------------------------- */
 

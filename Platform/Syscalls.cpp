@@ -113,6 +113,9 @@ char *realpath(const char *path, char *resolved) { PLZC_WRAP(Realpath, nullptr, 
 void *malloc(size_t size) { PLZC_WRAP(Malloc, nullptr, ::malloc(size)); }
 void *calloc(size_t count, size_t size) { PLZC_WRAP(Calloc, nullptr, ::calloc(count, size)); }
 int dup(int fd) { PLZC_WRAP(Dup, -1, ::dup(fd)); }
+off_t lseek(int fd, off_t offset, int whence) { PLZC_WRAP(Lseek, -1, ::lseek(fd, offset, whence)); }
+int chmod(const char *path, mode_t mode) { PLZC_WRAP(Chmod, -1, ::chmod(path, mode)); }
+int utimes(const char *path, const struct timeval times[2]) { PLZC_WRAP(Utimes, -1, ::utimes(path, times)); }
 
 #undef PLZC_WRAP
 

@@ -22,7 +22,7 @@ enum class Call : int {
   Stat, Lstat, Fstat, Statfs, Fstatfs,
   Getxattr, Lgetxattr, Fgetxattr, Setxattr, Lsetxattr, Fsetxattr,
   Removexattr, Lremovexattr, Fremovexattr, Listxattr, Llistxattr, Flistxattr,
-  Futimes, Rename, Mkdir, Realpath, Malloc, Calloc, Dup,
+  Futimes, Rename, Mkdir, Realpath, Malloc, Calloc, Dup, Lseek, Chmod, Utimes,
   Count
 };
 
@@ -62,6 +62,9 @@ char *realpath(const char *path, char *resolved);
 void *malloc(size_t size);
 void *calloc(size_t count, size_t size);
 int dup(int fd);
+off_t lseek(int fd, off_t offset, int whence);
+int chmod(const char *path, mode_t mode);
+int utimes(const char *path, const struct timeval times[2]);
 
 // Fault injection. `armFault(call, nth, error)` makes the nth call of that kind from now on
 // (1 = the next one) fail with `error`; with `sticky`, that call and every later one fail.

@@ -1,0 +1,17 @@
+// Type 3: a small file's single chunk kept inside the header attribute, behind the header.
+#pragma once
+
+#include <stdint.h>
+#include <sys/uio.h>
+
+#include "Common/FileHandle.h"
+
+constexpr uint32_t kType3ChunkSize = 131072;
+
+void *initCompressorType3(void *initArg1, void *initArg2, int32_t compressionLevel, int32_t allowLargeResourceForks);
+void freeContextType3(void *context);
+// 0 when the header attribute with the file's data was written, -1 otherwise (too large, too
+// incompressible, or the write failed). An empty file gives 0 and writes nothing.
+int compressFileType3(FileHandle *handle, const char *path, int64_t size, void *context);
+int64_t doUncompressType3(FileHandle *handle, int64_t offset, uint64_t size, uint32_t vectorCount,
+                          const struct iovec *vectors, const void *attribute);

@@ -1,0 +1,18 @@
+// Whole-file compression and reading back, inside the library.
+#pragma once
+
+#include <stdint.h>
+
+#include "Common/FileHandle.h"
+
+// MD5 of the file's logical data: the data fork of a plain file, the decompressed data of a
+// compressed one (the Linux kernel does not decompress, so the library reads it). 1 with the
+// 16-byte digest, 0 when the file cannot be opened (silently).
+int checksumFile(const char *path, uint8_t digest[16]);
+
+// Receives the logical data in order, in pieces of at most 128 KiB: -1 stops with failure.
+typedef int (*DecompressWriter)(int64_t offset, const void *bytes, int64_t count, void *writerCtx);
+
+// Hands the logical data of the compressed file behind fh to writer. 0 when every byte went
+// out; -1 on failure (reported) or when the writer returned -1.
+int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx);

@@ -1,0 +1,253 @@
+// Reading a compressed file back: its logical data to a writer, to standard output, or into
+// its own data fork in place.
+#include <fcntl.h>
+#include <sys/time.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstring>
+
+#include "Common/Diagnostics.h"
+#include "Common/ThrottlingAllocator.h"
+#include "Libraries/CompressData/CompressData.h"
+#include "Libraries/CompressData/CompressorRegistry.h"
+#include "Libraries/CompressData/DiskHeader.h"
+#include "Platform/FileFlags.h"
+#include "Platform/Syscalls.h"
+#include "Plenzo.h"
+
+static constexpr char kSourcePath[] = "Libraries/CompressData/Decompress";
+
+namespace {
+
+constexpr int64_t kPieceSize = 131072;
+
+// -1 until known; every thread stores the same answer.
+std::atomic<int> isRoot{-1};
+
+bool runningAsRoot() {
+  int known = isRoot.load(std::memory_order_relaxed);
+  if (known == -1) {
+    known = geteuid() == 0 ? 1 : 0;
+    isRoot.store(known, std::memory_order_relaxed);
+  }
+  return known == 1;
+}
+
+int _decompressWriter(int64_t offset, const void *bytes, int64_t count, void *writerCtx) {
+  auto *fh = static_cast<FileHandle *>(writerCtx);
+  return fh->pwrite(fh, bytes, count, offset) == count ? 0 : -1;
+}
+
+int catWriter(int64_t, const void *bytes, int64_t count, void *) {
+  ssize_t ignored = sys::write(1, bytes, static_cast<size_t>(count));
+  (void)ignored;
+  return 0;
+}
+
+struct timeval toTimeval(const struct timespec &time) {
+  return {time.tv_sec, time.tv_nsec / 1000};
+}
+
+}  // namespace
+
+int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx) {
+  int options = osSupportsDecmpfs() ? kShowCompressionOption : 0;
+  int64_t size = fh->getxattr(fh, kDecmpfsXattrName, nullptr, 0, 0, options);
+  if (size == -1) {
+    PLZC_ERR("%s:%d: fh_getxattr(%s,%s): %s\n", fh->name, kDecmpfsXattrName, strerror(errno));
+    return -1;
+  }
+  uint64_t blockSize = static_cast<uint64_t>(size) + 4;
+  auto *block = static_cast<AttrBuffer *>(waitThenAllocate(blockSize, 0));
+  if (!block) {
+    PLZC_ERR("%s:%d: waitThenAllocate(%llu): %s\n", static_cast<unsigned long long>(size), strerror(errno));
+    return -1;
+  }
+  uint8_t *output = nullptr;
+  int result = -1;
+  if (fh->getxattr(fh, kDecmpfsXattrName, block->attribute, static_cast<uint64_t>(size), 0, options) != size) {
+    PLZC_ERR("%s:%d: fh_getxattr(%s,%s): %s\n", fh->name, kDecmpfsXattrName, strerror(errno));
+  } else {
+    block->attrSize = static_cast<uint32_t>(size);
+    DiskHeader header{};
+    const CompressorOps *row = nullptr;
+    if (size >= static_cast<int64_t>(sizeof header)) {
+      memcpy(&header, block->attribute, sizeof header);
+      row = compressorForReading(header.compressionType);
+    }
+    output = static_cast<uint8_t *>(sys::malloc(kPieceSize));
+    if (!row) {
+      // A header too short to hold a type is refused like an unknown type.
+      PLZC_ERR("%s:%d: Error: invalid compressor type %d\n", static_cast<int>(header.compressionType));
+    } else if (!output) {
+      PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
+    } else {
+      int64_t remaining = static_cast<int64_t>(header.uncompressedSize), offset = 0;
+      result = 0;
+      while (remaining > 0) {
+        struct iovec vector = {output, static_cast<size_t>(remaining < kPieceSize ? remaining : kPieceSize)};
+        int64_t produced = row->doUncompress(fh, offset, vector.iov_len, 1, &vector, block);
+        // Nothing produced while bytes remain would ask for the same piece for ever.
+        if (produced <= 0 || writer(offset, output, produced, writerCtx) == -1) {
+          result = -1;
+          break;
+        }
+        remaining -= produced;
+        offset += produced;
+      }
+    }
+  }
+  free(output);
+  freeAndSignal(block, blockSize);
+  return result;
+}
+
+int decompressFile(const char *path, bool verify, int forceUserSpace) {
+  platform::Stat initial;
+  if (platform::stat(path, &initial) != 0) {
+    PLZC_ERR("%s:%d: Error: stat failed: %s (%d)\n", strerror(errno), errno);
+    return -1;
+  }
+  if (!(initial.st_flags & kCompressedFlag)) return 0;
+  int kernelDecompresses = osSupportsDecmpfs();
+  uint8_t before[16], after[16];
+  if (verify && !checksumFile(path, before)) {
+    PLZC_ERR("%s:%d: Error: Unable to checksum file '%s' before decompression.\n", path);
+    return -1;
+  }
+  bool restoreFlags = false, restoreMode = false;
+  if (initial.st_flags & ~kCompressedFlag) {
+    if (platform::chflags(path, kCompressedFlag) != 0) {
+      PLZC_ERR("%s:%d: Error: Failed to clear flags of compressed file at path '%s': %s (%d)\n", path,
+               strerror(errno), errno);
+      return -1;
+    }
+    restoreFlags = true;
+  }
+  mode_t mode = initial.st.st_mode;
+  if (!runningAsRoot() && (mode & 0222) != 0222) {
+    if (sys::chmod(path, (mode | 0222) & 07777) != 0) {
+      PLZC_ERR("%s:%d: Error: Failed to change mode of compressed file at path '%s': %s (%d)\n", path,
+               strerror(errno), errno);
+      return -1;
+    }
+    restoreMode = true;
+  }
+  if (kernelDecompresses && !forceUserSpace) {
+    // Opening a compressed file for writing makes the kernel expand it in place.
+    int fd = sys::open(path, O_WRONLY, 0);
+    if (fd < 0) {
+      PLZC_ERR("%s:%d: Error: Failed to open compressed file at path '%s' for writing: %s (%d)\n", path,
+               strerror(errno), errno);
+      return -1;
+    }
+    sys::close(fd);
+  } else {
+    FileHandle *fh = openFile(path, path, O_RDWR);
+    if (!fh) {
+      PLZC_ERR("%s:%d: Error: Failed to open compressed file at path '%s' for writing: %s (%d)\n", path,
+               strerror(errno), errno);
+      return -1;
+    }
+    if (decompressData(fh, _decompressWriter, fh) == -1) {
+      PLZC_ERR("%s:%d: Error: Failed to decompress data for file at path '%s': %s (%d)\n", path, strerror(errno),
+               errno);
+      fh->close(fh);
+      return -1;
+    }
+    for (const char *name : {kDecmpfsXattrName, kResourceForkXattrName}) {
+      if (fh->removexattr(fh, name, 0) == -1 && !(name == kResourceForkXattrName && errno == ENOATTR)) {
+        PLZC_ERR("%s:%d: Error: Failed to remove %s xattr of file at path '%s': %s (%d)\n", name, path,
+                 strerror(errno), errno);
+        fh->close(fh);
+        return -1;
+      }
+    }
+    fh->close(fh);
+    restoreFlags = true;
+  }
+  struct timeval times[2] = {toTimeval(initial.st.st_atim), toTimeval(initial.st.st_mtim)};
+  if (sys::utimes(path, times) != 0) {
+    PLZC_ERR("%s:%d: Error: Failed to restore timestamp of file at path '%s': %s (%d)\n", path, strerror(errno),
+             errno);
+    return -1;
+  }
+  if (restoreMode && sys::chmod(path, mode & 07777) != 0) {
+    PLZC_ERR("%s:%d: Error: Failed to restore mode of compressed file at path '%s': %s (%d)\n", path,
+             strerror(errno), errno);
+    return -1;
+  }
+  if (restoreFlags && platform::chflags(path, initial.st_flags & ~kCompressedFlag) != 0) {
+    PLZC_ERR("%s:%d: Error: Failed to set flags of compressed file at path '%s': %s (%d)\n", path, strerror(errno),
+             errno);
+    return -1;
+  }
+  platform::Stat now;
+  if (platform::stat(path, &now) != 0) {
+    PLZC_ERR("%s:%d: Error: !? Stat failed for path '%s' after file should have decompressed. %s (%d)\n", path,
+             strerror(errno), errno);
+    return -1;
+  }
+  if (now.st_flags & kCompressedFlag) {
+    PLZC_ERR("%s:%d: Error: File '%s' was still compressed after attempting decompression.\n", path);
+    return -1;
+  }
+  if ((now.st_flags ^ initial.st_flags) != kCompressedFlag) {
+    PLZC_ERR("%s:%d: Error: File '%s' changed flags attempting decompression.\n", path);
+    return -1;
+  }
+  if (kernelDecompresses && now.st.st_size != initial.st.st_size) {
+    PLZC_ERR("%s:%d: Error: File '%s' size changed after decompressing; went from %lld bytes to %lld bytes\n", path,
+             static_cast<long long>(initial.st.st_size), static_cast<long long>(now.st.st_size));
+    return -1;
+  }
+  if (verify) {
+    if (!checksumFile(path, after)) {
+      PLZC_ERR("%s:%d: Error: Unable to checksum file '%s' after decompression.\n", path);
+      return -1;
+    }
+    if (memcmp(before, after, sizeof before) != 0) {
+      PLZC_ERR("%s:%d: Error: File data after decompression is different than before for file '%s'.\n", path);
+      return -1;
+    }
+  }
+  return 0;
+}
+
+void catFile(const char *path, int forceUserSpace) {
+  platform::Stat st;
+  if (platform::stat(path, &st) != 0) {
+    PLZC_ERR("%s:%d: stat(%s): %s\n", path, strerror(errno));
+    return;
+  }
+  if ((st.st_flags & kCompressedFlag) && (!osSupportsDecmpfs() || forceUserSpace)) {
+    FileHandle *fh = openFile(path, path, O_RDONLY);
+    if (!fh) {
+      PLZC_ERR("%s:%d: Error: Failed to open compressed file at path '%s': %s (%d)\n", path, strerror(errno), errno);
+      return;
+    }
+    if (decompressData(fh, catWriter, nullptr) == -1)
+      PLZC_ERR("%s:%d: Error: Failed to decompress data for file at path '%s': %s (%d)\n", path, strerror(errno),
+               errno);
+    fh->close(fh);
+    return;
+  }
+  int fd = sys::open(path, O_RDONLY, 0);
+  if (fd < 0) {
+    PLZC_ERR("%s:%d: open(%s): %s\n", path, strerror(errno));
+    return;
+  }
+  int64_t remaining = st.st.st_size;
+  char block[4096];
+  ssize_t got;
+  while ((got = sys::read(fd, block, sizeof block)) > 0) {
+    ssize_t ignored = sys::write(1, block, static_cast<size_t>(got));
+    (void)ignored;
+    remaining -= got;
+  }
+  if (got == -1) PLZC_ERR("%s:%d: read: %s\n", strerror(errno));
+  sys::close(fd);
+  if (remaining != 0) PLZC_ERR("%s:%d: Error: didn't read all of '%s'\n", path);
+}
