@@ -17,6 +17,8 @@
 #include <stdbool.h>
 #include <stdint.h>
 
+#include "PropertyValue.h"
+
 #ifdef __cplusplus
 extern "C" {
 #endif
@@ -121,6 +123,20 @@ PLZC_EXPORT FileEnumerator *initFileEnumeratorFromFileList(const char *listPath,
 PLZC_EXPORT int enumFilesFromFileList(FileEnumerator *enumerator, const char **pathOut);
 /* Releases the list and frees the enumerator; NULL is ignored. */
 PLZC_EXPORT void freeFileEnumeratorFromFileList(FileEnumerator *enumerator);
+
+/* ---- Compression rules ------------------------------------------------------------------ */
+
+/* Keys and values of a rule dictionary, for building rule arrays ("CompressionRules",
+ * "SystemCompressionRules" options). A rule is {"RuleType": "Include" | "Exclude", and one
+ * match key: "PathEndsWithString", "PathBeginsWithString", "PathContainsString" or
+ * "PathExactlyEqualsString"}. Constants: never release them. */
+PLZC_EXPORT extern const PVStringRef kPLZCRuleTypeKey;
+PLZC_EXPORT extern const PVStringRef kPLZCRuleTypeInclude;
+PLZC_EXPORT extern const PVStringRef kPLZCRuleTypeExclude;
+PLZC_EXPORT extern const PVStringRef kPLZCPathEndsWithStringKey;
+PLZC_EXPORT extern const PVStringRef kPLZCPathBeginsWithStringKey;
+PLZC_EXPORT extern const PVStringRef kPLZCPathContainsStringKey;
+PLZC_EXPORT extern const PVStringRef kPLZCPathExactlyEqualsStringKey;
 
 /* ---- Type-5 request handler ----------------------------------------------------------- */
 

@@ -340,8 +340,16 @@ PV_EXPORT void PVDictionaryApply(PVDictionaryRef dictionary, PVDictionaryApplier
 PV_EXPORT void PVDictionaryGetKeysAndValues(PVDictionaryRef dictionary, PVRef *keys, const void **values);
 
 /* ---- Property lists ------------------------------------------------------------------- */
-/* Reading XML property lists into these values belongs here; it is to be built on Debian's
- * libplist in Common/PropertyValuePropertyList.cpp and is not available yet. */
+/* XML property lists become immutable values: dict, array, string, integer (int64), real
+ * (double), true/false, data. Dates and keyed-archive identifiers have no value kind here and
+ * make the whole list fail. */
+
+/* Parses data holding an XML property list. Returns the top-level value, or NULL when the
+ * data is not a well-formed XML property list or holds a kind listed above as unsupported. */
+PV_EXPORT PVRef PVPropertyListCreateWithXMLData(PVDataRef data);
+
+/* Reads a whole file into a new data value; NULL with errno when it cannot be read. */
+PV_EXPORT PVDataRef PVDataCreateWithContentsOfFile(const char *path);
 
 #ifdef __cplusplus
 }
