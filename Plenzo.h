@@ -138,6 +138,12 @@ PLZC_EXPORT extern const PVStringRef kPLZCPathBeginsWithStringKey;
 PLZC_EXPORT extern const PVStringRef kPLZCPathContainsStringKey;
 PLZC_EXPORT extern const PVStringRef kPLZCPathExactlyEqualsStringKey;
 
+/* Options naming Mach-O file types left uncompressed (an array of names such as "MH_EXECUTE",
+ * numbers 1 to 31, or "*" for every type), and paths relative to the destination root that are
+ * compressed whatever their type (an array of strings). */
+PLZC_EXPORT extern const PVStringRef kPLZCSkipMachOFileTypes;
+PLZC_EXPORT extern const PVStringRef kPLZCSkipMachOOverridePaths;
+
 /* ---- Type-5 request handler ----------------------------------------------------------- */
 
 /* The answer to one type-1 request: an opaque, reference-counted handle on that request's own
