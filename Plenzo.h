@@ -144,6 +144,76 @@ PLZC_EXPORT extern const PVStringRef kPLZCPathExactlyEqualsStringKey;
 PLZC_EXPORT extern const PVStringRef kPLZCSkipMachOFileTypes;
 PLZC_EXPORT extern const PVStringRef kPLZCSkipMachOOverridePaths;
 
+/* ---- Stream compression ----------------------------------------------------------------- */
+
+/* One run of the asynchronous pipeline: new files are written through streams, compressed on
+ * worker threads while the caller goes on, and written out compressed (or plain when
+ * compression does not pay or is not wanted). Create the queue, create a stream per file, write
+ * the file's bytes and close the stream; finish the queue once every stream is closed. */
+typedef struct StreamCompressorQueue StreamCompressorQueue;
+typedef struct StreamCompressor StreamCompressor;
+
+/* Option keys (constants; never release them):
+ * "IgnoreXattrErrors" (boolean): write the plain data when compressed attributes cannot be
+ *   stored, instead of failing the queue.
+ * "CompressionRules", "SystemCompressionRules" (arrays of rules, see the rule keys above): the
+ *   caller's rules, and system rules replacing the library's own list.
+ * "CompressionTypes" (string, default "4"): compression types to try, as for initCompressor.
+ * "CompressionLevel" (integer, default from the settings file, else 5).
+ * "AllowLargeResourceForks" (boolean): lift type 4's 64 MiB file and 16 MiB fork caps.
+ * "PLZCThrottledIO" (boolean): run the work with background I/O and CPU priority.
+ * "SkipMachOFileTypes", "SkipMachOOverridePaths": see above. */
+PLZC_EXPORT extern const PVStringRef kPLZCIgnoreXattrErrors;
+PLZC_EXPORT extern const PVStringRef kPLZCCompressionRulesKey;
+PLZC_EXPORT extern const PVStringRef kPLZCCompressionSystemRulesKey;
+PLZC_EXPORT extern const PVStringRef kPLZCCompressionTypes;
+PLZC_EXPORT extern const PVStringRef kPLZCCompressionLevel;
+PLZC_EXPORT extern const PVStringRef kPLZCAllowLargeResourceForks;
+PLZC_EXPORT extern const PVStringRef kPLZCThrottledIO;
+
+/* A new queue from options (a dictionary, retained; NULL for every default). NULL when out of
+ * memory or when "SkipMachOFileTypes" holds an invalid item (reported). */
+PLZC_EXPORT StreamCompressorQueue *CreateStreamCompressorQueueWithOptions(PVDictionaryRef options);
+PLZC_EXPORT StreamCompressorQueue *CreateStreamCompressorQueue(void);
+
+/* Waits until every file of the queue has been compressed and written out, then releases the
+ * caller's reference. 0, or -1 with errno: the last error any file recorded, or EINVAL when
+ * the queue is NULL or not every item ran. The queue must not be used afterwards. */
+PLZC_EXPORT int FinishStreamCompressorQueue(StreamCompressorQueue *queue);
+
+/* A stream for the file open on fd (writable; positioned at its start, not written through by
+ * the caller meanwhile) at path, under the destination root prefix (or NULL), whose final size
+ * is expectedSize bytes. The pipeline decides by the rules whether to compress it and starts
+ * its work at once. NULL when the pipeline takes no part in the file (a name beginning "._")
+ * or on failure (reported). */
+PLZC_EXPORT StreamCompressor *CreateStreamCompressor(int fd, const char *path, const char *prefix,
+                                                     StreamCompressorQueue *queue, int64_t expectedSize);
+
+/* Adds count bytes of the file; blocks while the stream's 64 MiB ring is full. count, or -1
+ * with errno (the queue's recorded error; ENOSPC when the pipeline stopped taking this file's
+ * data; a write past expectedSize). */
+PLZC_EXPORT int64_t WriteToStreamCompressor(StreamCompressor *stream, const void *buffer, uint64_t count);
+
+/* Ends the file's data and gives the stream back; the pipeline finishes the file later. 0, or
+ * -1 with the queue's recorded error (the stream is closed either way). */
+PLZC_EXPORT int CloseStreamCompressor(StreamCompressor *stream);
+
+/* ---- Compression queue -------------------------------------------------------------------- */
+
+/* Existing files compressed in place through the stream pipeline: a queue in in-place mode.
+ * The first four arguments are ignored; options as for the stream queue. NULL on failure. */
+PLZC_EXPORT StreamCompressorQueue *CreateCompressionQueue(void *unused1, void *unused2, void *unused3, void *unused4,
+                                                          PVDictionaryRef options);
+
+/* Hands the file at path (prefix: the root the rules see it under, or NULL) to the queue and
+ * returns once its data is in the pipeline; compression and write-out go on afterwards. 1 when
+ * handed over, or when the pipeline takes no part in the file (rules, empty, "._" names); 0 on
+ * failure (reported). May be called from several threads at once. */
+PLZC_EXPORT int CompressFile(StreamCompressorQueue *queue, const char *path, const char *prefix);
+
+/* Waits for every file of the queue and releases it; a failure is reported on standard error. */
+PLZC_EXPORT void FinishCompressionAndCleanUp(StreamCompressorQueue *queue);
+
 /* ---- Type-5 request handler ----------------------------------------------------------- */
 
 /* The answer to one type-1 request: an opaque, reference-counted handle on that request's own
@@ -185,6 +255,31 @@ PLZC_EXPORT int Type5CompletionInvoke(Type5Completion *completion, uint64_t r1, 
 
 /* Gives back one reference; the last one frees the record. NULL does nothing. */
 PLZC_EXPORT void Type5CompletionRelease(Type5Completion *completion);
+
+/* ---- File locks by inode -------------------------------------------------------------- */
+
+/* An exclusive lock on a file identified by its device and inode numbers, so that every path
+ * to the file (hard links, symbolic links, a descriptor) takes the same lock. It orders the
+ * threads of this process only; other processes and the file system never see it. The
+ * library's write-out holds it while it rewrites a file. Each successful lock call is matched
+ * by exactly one PLZCUnlockFile on the same thread; a thread must not lock a file it already
+ * holds (it would wait for itself). The handle is opaque. */
+typedef struct FileLock FileLock;
+
+/* Blocks until the calling thread holds the lock of the file with device number dev (st_dev,
+ * as 32 bits) and inode number ino. Returns the handle, or NULL with errno ENOMEM. */
+PLZC_EXPORT FileLock *PLZCLockFileIno(int32_t dev, uint64_t ino);
+
+/* As PLZCLockFileIno for the file open on fd. NULL with errno from fstat after a message. */
+PLZC_EXPORT FileLock *PLZCLockFileFd(int fd);
+
+/* As PLZCLockFileIno for the file at path, symbolic links followed. NULL with errno from stat
+ * after a message. */
+PLZC_EXPORT FileLock *PLZCLockFilePath(const char *path);
+
+/* Releases a lock taken by this thread; the handle is invalid afterwards. 0, or -1 with
+ * errno EINVAL for NULL. */
+PLZC_EXPORT int PLZCUnlockFile(FileLock *lock);
 
 #ifdef __cplusplus
 }
