@@ -118,14 +118,8 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
     return -1;
   }
   bool restoreFlags = false, restoreMode = false;
-  if (initial.st_flags & ~kCompressedFlag) {
-    if (platform::chflags(path, kCompressedFlag) != 0) {
-      PLZC_ERR("%s:%d: Error: Failed to clear flags of compressed file at path '%s': %s (%d)\n", path,
-               strerror(errno), errno);
-      return -1;
-    }
-    restoreFlags = true;
-  }
+  // The flag word is an attribute that only a writer may change, while Linux does not enforce
+  // the flags themselves: the mode is widened before the flags are touched and restored after.
   mode_t mode = initial.st.st_mode;
   if (!runningAsRoot() && (mode & 0222) != 0222) {
     if (sys::chmod(path, (mode | 0222) & 07777) != 0) {
@@ -134,6 +128,14 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
       return -1;
     }
     restoreMode = true;
+  }
+  if (initial.st_flags & ~kCompressedFlag) {
+    if (platform::chflags(path, kCompressedFlag) != 0) {
+      PLZC_ERR("%s:%d: Error: Failed to clear flags of compressed file at path '%s': %s (%d)\n", path,
+               strerror(errno), errno);
+      return -1;
+    }
+    restoreFlags = true;
   }
   if (kernelDecompresses && !forceUserSpace) {
     // Opening a compressed file for writing makes the kernel expand it in place.
@@ -174,14 +176,14 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
              errno);
     return -1;
   }
-  if (restoreMode && sys::chmod(path, mode & 07777) != 0) {
-    PLZC_ERR("%s:%d: Error: Failed to restore mode of compressed file at path '%s': %s (%d)\n", path,
-             strerror(errno), errno);
-    return -1;
-  }
   if (restoreFlags && platform::chflags(path, initial.st_flags & ~kCompressedFlag) != 0) {
     PLZC_ERR("%s:%d: Error: Failed to set flags of compressed file at path '%s': %s (%d)\n", path, strerror(errno),
              errno);
+    return -1;
+  }
+  if (restoreMode && sys::chmod(path, mode & 07777) != 0) {
+    PLZC_ERR("%s:%d: Error: Failed to restore mode of compressed file at path '%s': %s (%d)\n", path,
+             strerror(errno), errno);
     return -1;
   }
   platform::Stat now;
