@@ -10,6 +10,7 @@
 #include <cstring>
 
 #include "Common/Diagnostics.h"
+#include "Common/WorkQueue.h"
 #include "Platform/SystemResources.h"
 #include "Platform/Syscalls.h"
 
@@ -81,7 +82,12 @@ void descriptorBudgetFor(uint64_t soft, uint64_t hard, uint64_t *newSoft, uint64
 void *waitThenAllocate(uint64_t size, int32_t zeroFill) {
   pthread_mutex_lock(&totalPoolAllocsLock);
   if (maxPoolAllocs == 0) computeMemoryBudget();
-  while (totalPoolAllocs + size >= maxPoolAllocs) pthread_cond_wait(&totalPoolAllocsCond, &totalPoolAllocsLock);
+  if (totalPoolAllocs + size >= maxPoolAllocs) {
+    // Memory comes back from other work, perhaps queued on this thread's own pool.
+    workQueueBlockingBegin();
+    while (totalPoolAllocs + size >= maxPoolAllocs) pthread_cond_wait(&totalPoolAllocsCond, &totalPoolAllocsLock);
+    workQueueBlockingEnd();
+  }
   // calloc gets large zeroed blocks straight from the system, without clearing them again.
   void *block = zeroFill ? sys::calloc(1, size) : sys::malloc(size);
   // Only blocks that were obtained are charged, so the total stays exact.
@@ -103,8 +109,12 @@ int32_t waitThenDupOrOpen(const char *path, int32_t fd) {
   pthread_once(&once_rlimit, _RaiseRlimit);
   pthread_mutex_lock(&compressorFdsLock);
   for (;;) {
-    while (static_cast<uint64_t>(compressorFdsCount) * 10 >= max_fds * 9)
-      pthread_cond_wait(&compressorFdsCond, &compressorFdsLock);
+    if (static_cast<uint64_t>(compressorFdsCount) * 10 >= max_fds * 9) {
+      workQueueBlockingBegin();
+      while (static_cast<uint64_t>(compressorFdsCount) * 10 >= max_fds * 9)
+        pthread_cond_wait(&compressorFdsCond, &compressorFdsLock);
+      workQueueBlockingEnd();
+    }
     int result = path ? sys::open(path, O_RDONLY, 0) : sys::dup(fd);
     if (result >= 0) {
       compressorFdsCount++;
