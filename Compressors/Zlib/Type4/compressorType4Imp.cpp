@@ -1,0 +1,292 @@
+// Type 4: chunks of 64 KiB in the resource fork, laid out as a fork holding one 'cmpf'
+// resource (ID 1) whose data is the chunk count, the chunk table and the chunks; the header
+// attribute holds only the 16-byte header. A file whose one chunk is small enough goes into
+// the header attribute instead, in the type-3 form.
+//
+// Fork layout (D = length of the resource's data, N = chunk count):
+//   0    four big-endian words: 256, 260 + D, D + 4, 50
+//   16   240 zero bytes
+//   256  D, big-endian
+//   260  N, little-endian
+//   264  N table entries: chunk offset (counted from 260) and length, little-endian u32 each
+//   ...  the chunks, back to back
+//   260 + D  the 50-byte resource map
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "Common/Diagnostics.h"
+#include "Common/commonUtils.h"
+#include "Compressors/Zlib/ByteOrder.h"
+#include "Compressors/Zlib/Type4/compressorType4.h"
+#include "Libraries/CompressData/DiskHeader.h"
+#include "Platform/Syscalls.h"
+
+static constexpr char kSourcePath[] = "Compressors/Zlib/Type4/compressorType4Imp";
+
+namespace {
+
+constexpr uint32_t kResourceDataOffset = 256;
+constexpr uint32_t kDataStart = 260;  // the chunk count; chunk-table offsets count from here
+constexpr uint32_t kMapLength = 50;
+constexpr int64_t kForkOverhead = kDataStart + kMapLength;  // the fork is D + 310 bytes
+constexpr int64_t kMaxFileSize = 67108864;                  // 64 MiB, unless large forks are allowed
+constexpr int64_t kMaxDataLength = 16777216 - kForkOverhead;  // a 16 MiB fork, likewise
+// Fork positions and table fields are 32-bit: the whole fork must stay below 4 GiB.
+constexpr int64_t kMaxDataLength32 = 0xFFFFFFFFLL - kForkOverhead;
+constexpr uint64_t kMaxChunkCount = 0xFFFFFFFFULL;
+constexpr uint32_t kTableEntrySize = 8;
+
+// The resource map: one type 'cmpf' with one resource, ID 1, no name, whose data starts at
+// the beginning of the resource data. Written unchanged.
+constexpr uint8_t kDataSuffix[kMapLength] = {
+    0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0,  // reserved copy of the fork header
+    0, 0, 0, 0,                                      // handle to the next map
+    0, 0,                                            // file reference number
+    0, 0,                                            // fork attributes
+    0x00, 0x1C,                                      // offset to the type list
+    0x00, 0x32,                                      // offset to the name list (none)
+    0x00, 0x00,                                      // number of types - 1
+    'c', 'm', 'p', 'f',                              // the type
+    0x00, 0x00,                                      // resources of this type - 1
+    0x00, 0x0A,                                      // offset to its reference list
+    0x00, 0x01,                                      // resource ID
+    0xFF, 0xFF,                                      // no name
+    0x00,                                            // resource attributes
+    0x00, 0x00, 0x00,                                // offset of its data in the resource data
+    0, 0, 0, 0,                                      // handle
+};
+
+struct Type4Context {
+  uint32_t compressionLevel;
+  uint8_t allowLargeResourceForks;
+};
+
+struct Type4State {
+  FileHandle *handle;
+  uint64_t dataStart;
+  uint64_t tablePos;
+  int64_t dataLimit;
+  uint64_t fileSize;
+  uint32_t dataLength;
+  uint32_t chunkCount;
+  uint32_t inlineLength;  // length of the header attribute when the type-3 form was written
+  uint32_t supplyOffset;  // the engine's prefix for this call
+};
+
+int forkReadOptions() { return osSupportsDecmpfs() ? kShowCompressionOption : 0; }
+
+int writeFork(Type4State *state, const void *bytes, uint32_t length, uint64_t position) {
+  FileHandle *handle = state->handle;
+  if (handle->setxattr(handle, kResourceForkXattrName, bytes, length, static_cast<uint32_t>(position), 0) != 0) {
+    PLZC_ERR("%s:%d: fh_setxattr: %s\n", strerror(errno));
+    return -1;
+  }
+  return 0;
+}
+
+int emitBytesType4(void *opaque, uint64_t chunkCount, uint64_t chunkIndex, uint8_t *buffer, uint32_t length) {
+  auto *state = static_cast<Type4State *>(opaque);
+  FileHandle *handle = state->handle;
+  if (chunkIndex == 0) {
+    if (chunkCount > kMaxChunkCount) return -1;
+    if (chunkCount == 1 && length + kDiskHeaderSize <= kMaxType3AttributeSize) {
+      plzc::storeDiskHeader(buffer, 3, state->fileSize);
+      if (handle->setxattr(handle, kDecmpfsXattrName, buffer, length + kDiskHeaderSize, 0, 0) != 0) {
+        PLZC_ERR("%s:%d: setxattr %s: %s\n", handle->path, strerror(errno));
+        return -1;
+      }
+      state->inlineLength = length + kDiskHeaderSize;
+      return 0;
+    }
+    // The table alone must fit the budget; checked in 64 bits so that a huge count cannot wrap.
+    uint64_t tableEnd = kTableEntrySize * chunkCount + 4;
+    if (static_cast<int64_t>(tableEnd) > state->dataLimit) return -1;
+    uint8_t count[4];
+    plzc::storeLE32(count, static_cast<uint32_t>(chunkCount));
+    if (writeFork(state, count, sizeof count, state->dataStart) != 0) return -1;
+    state->chunkCount = static_cast<uint32_t>(chunkCount);
+    state->tablePos = state->dataStart + 4;
+    state->dataLength = static_cast<uint32_t>(tableEnd);
+  }
+  if (static_cast<int64_t>(state->dataLength) + length > state->dataLimit) return -1;
+  uint8_t entry[kTableEntrySize];
+  plzc::storeLE32(entry, state->dataLength);
+  plzc::storeLE32(entry + 4, length);
+  if (writeFork(state, entry, sizeof entry, state->tablePos) != 0) return -1;
+  state->tablePos += kTableEntrySize;
+  if (writeFork(state, buffer + kDiskHeaderSize, length, state->dataStart + state->dataLength) != 0) return -1;
+  state->dataLength += length;
+  return 0;
+}
+
+uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, uint32_t capacity) {
+  auto *state = static_cast<Type4State *>(opaque);
+  FileHandle *handle = state->handle;
+  if (chunkIndex >= state->chunkCount) {
+    PLZC_ERR("%s:%d: Error: %d is greater than max chunk %d\n", static_cast<int>(chunkIndex),
+             static_cast<int>(state->chunkCount));
+    return 0;
+  }
+  // A corrupt count or table can point past what 32-bit fork positions reach.
+  uint64_t entryPosition = kDataStart + 4 + kTableEntrySize * chunkIndex;
+  uint8_t entry[kTableEntrySize];
+  int64_t got = -1;
+  if (entryPosition <= 0xFFFFFFFFULL - kTableEntrySize)
+    got = handle->getxattr(handle, kResourceForkXattrName, entry, sizeof entry,
+                           static_cast<uint32_t>(entryPosition), forkReadOptions());
+  else
+    errno = EINVAL;
+  if (got != static_cast<int64_t>(sizeof entry)) {
+    PLZC_ERR("%s:%d: fh_getxattr %s: %s\n", handle->path, strerror(errno));
+    return kChunkError;
+  }
+  uint32_t chunkOffset = plzc::loadLE32(entry);
+  uint32_t chunkLength = plzc::loadLE32(entry + 4);
+  if (chunkLength > capacity) {
+    PLZC_ERR("%s:%d: Error: %s: %d is less than needed size %d\n", handle->path, static_cast<int>(capacity),
+             static_cast<int>(chunkLength));
+    return kChunkError;
+  }
+  uint64_t chunkPosition = static_cast<uint64_t>(kDataStart) + chunkOffset;
+  got = -1;
+  if (chunkPosition <= 0xFFFFFFFFULL)
+    got = handle->getxattr(handle, kResourceForkXattrName, buffer + state->supplyOffset, chunkLength,
+                           static_cast<uint32_t>(chunkPosition), forkReadOptions());
+  else
+    errno = EINVAL;
+  if (got != static_cast<int64_t>(chunkLength)) {
+    PLZC_ERR("%s:%d: fh_getxattr %s: %s\n", handle->path, strerror(errno));
+    return kChunkError;
+  }
+  return chunkLength;
+}
+
+int64_t roundUpBlocks(int64_t bytes, int64_t blockSize) { return (bytes + blockSize - 1) / blockSize; }
+
+int64_t usableBlockSize(FileHandle *handle) {
+  int64_t blockSize = handle->blockSize(handle);
+  return blockSize > 0 ? blockSize : 4096;
+}
+
+// Compresses the file into the fork and the header attribute; *inlineForm tells whether the
+// type-3 form was written instead. 0, or the engine's result, or -1.
+int doCompressType4(FileHandle *handle, int32_t level, bool allowLargeResourceForks, bool *inlineForm) {
+  *inlineForm = false;
+  int64_t size = handle->size(handle);
+  if (size < 0) return -1;
+  int64_t blockSize = usableBlockSize(handle);
+  // The whole fork, D + 310, must save at least a fifth of the file's blocks.
+  int64_t budgetBlocks = std::max<int64_t>(roundUpBlocks(size, blockSize) * 4 / 5, 1);
+  int64_t dataLimit = budgetBlocks * blockSize - kForkOverhead;
+  if (!allowLargeResourceForks && dataLimit > kMaxDataLength) dataLimit = kMaxDataLength;
+  dataLimit = std::min(dataLimit, kMaxDataLength32);
+
+  Type4State state = {};
+  state.handle = handle;
+  state.dataStart = kDataStart;
+  state.dataLimit = dataLimit;
+  state.fileSize = static_cast<uint64_t>(size);
+  state.supplyOffset = kDiskHeaderSize;
+  int result = chunkingCompressor(handle, 0, kType4ChunkSize, 0, static_cast<int32_t>(kDiskHeaderSize), 0, &state,
+                                  emitBytesType4, supplyChunkType4, level);
+  if (result != 0) return result;
+  if (state.inlineLength != 0) {
+    *inlineForm = true;
+    return 0;
+  }
+
+  uint32_t dataLength = state.dataLength;
+  uint8_t head[kDataStart] = {};
+  plzc::storeBE32(head, kResourceDataOffset);
+  plzc::storeBE32(head + 4, kDataStart + dataLength);
+  plzc::storeBE32(head + 8, dataLength + 4);
+  plzc::storeBE32(head + 12, kMapLength);
+  plzc::storeBE32(head + kResourceDataOffset, dataLength);
+  if (writeFork(&state, head, sizeof head, 0) != 0) return -1;
+  if (writeFork(&state, kDataSuffix, sizeof kDataSuffix, kDataStart + static_cast<uint64_t>(dataLength)) != 0)
+    return -1;
+
+  // Last of all, so that a reader never finds a type-4 header before the fork is complete.
+  auto *header = static_cast<uint8_t *>(sys::malloc(kDiskHeaderSize));
+  if (!header) {
+    PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
+    return -1;
+  }
+  plzc::storeDiskHeader(header, 4, static_cast<uint64_t>(size));
+  result = handle->setxattr(handle, kDecmpfsXattrName, header, kDiskHeaderSize, 0, 0);
+  if (result != 0) PLZC_ERR("%s:%d: fh_setxattr %s: %s\n", handle->path, strerror(errno));
+  free(header);
+  return result;
+}
+
+void removeFork(FileHandle *handle) {
+  int savedErrno = errno;
+  handle->removexattr(handle, kResourceForkXattrName, 0);
+  errno = savedErrno;
+}
+
+}  // namespace
+
+void *initCompressorType4(void *initArg1, void *initArg2, int32_t compressionLevel, int32_t allowLargeResourceForks) {
+  auto *context = static_cast<Type4Context *>(calloc(1, sizeof(Type4Context)));
+  if (context) {
+    context->compressionLevel = static_cast<uint32_t>(compressionLevel);
+    context->allowLargeResourceForks = allowLargeResourceForks != 0;
+  }
+  return context;
+}
+
+void freeContextType4(void *context) { free(context); }
+
+int compressFileType4(FileHandle *handle, const char *path, int64_t size, void *opaqueContext) {
+  auto *context = static_cast<Type4Context *>(opaqueContext);
+  if (!context->allowLargeResourceForks && size > kMaxFileSize) return -1;
+  bool inlineForm = false;
+  if (doCompressType4(handle, static_cast<int32_t>(context->compressionLevel), context->allowLargeResourceForks != 0,
+                      &inlineForm) != 0) {
+    removeFork(handle);
+    return -1;
+  }
+  if (inlineForm) return 0;
+
+  int64_t forkSize = handle->getxattr(handle, kResourceForkXattrName, nullptr, 0, 0, 0);
+  if (forkSize < 0) {
+    removeFork(handle);
+    return -1;
+  }
+  int64_t blockSize = usableBlockSize(handle);
+  int64_t forkBlocks = roundUpBlocks(forkSize, blockSize);
+  int64_t fileBlocks = roundUpBlocks(size, blockSize);
+  if (forkBlocks * 5 <= fileBlocks * 4) return 0;
+  printf("  Type4 file did not shrink: %s (%lld/%lld blocks -> %lld/%lld %.1lf%%)\n", path,
+         static_cast<long long>(size), static_cast<long long>(fileBlocks), static_cast<long long>(forkSize),
+         static_cast<long long>(forkBlocks), forkBlocks * 100.0 / static_cast<double>(fileBlocks));
+  fflush(stdout);
+  removeFork(handle);
+  return -1;
+}
+
+int64_t doUncompressType4(FileHandle *handle, int64_t offset, uint64_t size, uint32_t vectorCount,
+                          const struct iovec *vectors, const void *attribute) {
+  if (!handle) {
+    PLZC_ERR("%s:%d: null inputFile: %s\n", strerror(errno));
+    return -1;
+  }
+  Type4State state = {};
+  state.handle = handle;
+  state.dataStart = kDataStart;
+  uint8_t count[4];
+  int64_t got = handle->getxattr(handle, kResourceForkXattrName, count, sizeof count, kDataStart, forkReadOptions());
+  if (got != static_cast<int64_t>(sizeof count)) {
+    PLZC_ERR("%s:%d: readBytes %s: %lld: %s\n", handle->path, static_cast<long long>(got), strerror(errno));
+    return -1;
+  }
+  state.chunkCount = plzc::loadLE32(count);
+  int64_t result = chunkingDecompressor(offset, size, vectorCount, vectors, kType4ChunkSize, 0, 0, &state,
+                                        supplyChunkType4);
+  if (result == -1) PLZC_ERR("%s:%d: chunkingDecompressor %s: %s\n", handle->path, strerror(errno));
+  return result;
+}
