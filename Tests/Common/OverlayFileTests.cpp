@@ -1,5 +1,8 @@
 #include "Common/OverlayFile.h"
 
+#include "Common/DataPool.h"
+#include "Compressors/Zlib/Type4/compressorType4.h"
+
 #include <fcntl.h>
 #include <unistd.h>
 
@@ -7,6 +10,7 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <thread>
 
 #include "Platform/ExtendedAttributes.h"
 #include "Platform/Syscalls.h"
@@ -293,6 +297,48 @@ TEST_F(OverlayFile, ApplyingIsAllOrNothing) {
   EXPECT_EQ(platform::getxattr(path.c_str(), "three", &value, 1, 0, 0), 1);
   EXPECT_EQ(value, '3');
   close(fd);
+}
+
+// A type-4 attempt that fails part-way through a read-once pool gives back what it consumed,
+// so that the plain write-out still reads the whole file from the start.
+TEST(OverlayGiveBack, FailedAttemptOnAPoolLeavesEveryByteForTheNextReader) {
+  // Compressible chunks first (if any), then random ones that blow the fork's budget: at
+  // chunk 0 for the small file, at a later chunk for the others.
+  struct Shape {
+    size_t compressibleChunks, randomBytes;
+  } shapes[] = {{0, 10000}, {0, 40 * 65536 + 123}, {5, 40 * 65536 + 123}};
+  for (const Shape &shape : shapes) {
+    SCOPED_TRACE(shape.compressibleChunks * 65536 + shape.randomBytes);
+    std::vector<uint8_t> file(shape.compressibleChunks * 65536, 'a');
+    std::vector<uint8_t> random = randomBytes(shape.randomBytes, 9);
+    file.insert(file.end(), random.begin(), random.end());
+    DataPool *pool = newDataPool(static_cast<int64_t>(file.size()));
+    ASSERT_NE(pool, nullptr);
+    std::thread writer([&] {
+      for (size_t at = 0; at < file.size(); at += 10000)
+        ASSERT_GT(addDataToPool(pool, file.data() + at, std::min<size_t>(10000, file.size() - at)), 0);
+      finishDataPool(pool);
+    });
+    FileHandle *poolFile = openDataPoolFile(pool, "pool");
+    PVMutableDictionaryRef dict = PVDictionaryCreateMutable(0, kPVDictionaryRetainedValues);
+    FileHandle *overlay = openTocFile(poolFile, dict, 1);
+    void *context = initCompressorType4(nullptr, nullptr, 5, 0);
+    EXPECT_EQ(compressFileType4(overlay, "pool", static_cast<int64_t>(file.size()), context), -1);
+    freeContextType4(context);
+
+    std::vector<uint8_t> back(file.size());
+    int64_t got = 0;
+    for (int64_t n; got < static_cast<int64_t>(back.size()) &&
+                    (n = overlay->pread(overlay, back.data() + got, 100000, got)) > 0;)
+      got += n;
+    EXPECT_EQ(got, static_cast<int64_t>(file.size()));
+    EXPECT_TRUE(back == file);
+    writer.join();
+    overlay->close(overlay);
+    poolFile->close(poolFile);
+    PVRelease(dict);
+    releaseDataPool(pool);
+  }
 }
 
 }  // namespace
