@@ -55,7 +55,10 @@ int queryCompressionInfo(const char *path, CompressionInfo *info) {
   }
   info->compressionType = header.compressionType;
   info->uncompressedSize = header.uncompressedSize;
-  if (header.uncompressedSize != static_cast<uint64_t>(st.st.st_size))
+  // Where the kernel does not decompress, stat reports the data fork, empty once compressed:
+  // only a non-empty data fork can disagree with the header.
+  bool statShowsLogicalSize = osSupportsDecmpfs() || st.st.st_size != 0;
+  if (statShowsLogicalSize && header.uncompressedSize != static_cast<uint64_t>(st.st.st_size))
     PLZC_ERR("%s:%d: Error: Uncompressed size for path '%s' as reported by stat did not match size in disk header!\n",
              path);
 

@@ -1,0 +1,191 @@
+// plzc decompress and plzc cat: compressed files back into plain files, or their data to
+// standard output.
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <string>
+
+#include "Cli.h"
+#include "Console.h"
+#include "FileWalk.h"
+#include "Platform/FileFlags.h"
+#include "Plenzo.h"
+#include "Progress.h"
+#include "StderrCapture.h"
+#include "StoredForm.h"
+
+namespace plzc {
+
+namespace {
+
+enum LongOnly { kVerify = 256, kUserSpace, kNoProgress };
+
+const option kDecompressOptions[] = {
+    {"verify", no_argument, nullptr, kVerify}, {"user-space", no_argument, nullptr, kUserSpace},
+    {"jobs", required_argument, nullptr, 'j'}, {"verbose", no_argument, nullptr, 'v'},
+    {"no-progress", no_argument, nullptr, kNoProgress}, {"help", no_argument, nullptr, 'h'},
+    {nullptr, 0, nullptr, 0},
+};
+
+void printDecompressHelp() {
+  printf(
+      "Usage: plzc decompress [OPTION]... PATH...\n"
+      "Turn compressed files, and every compressed file in the trees named, back into plain files\n"
+      "in place, with their times, mode and other flags as they were. Plain files are left alone.\n"
+      "\n"
+      "      --verify       checksum each file's data before and compare it afterwards\n"
+      "      --user-space   decompress in the library even where the kernel could (on Linux the\n"
+      "                     library always does)\n"
+      "  -j, --jobs=N       worker threads (default: one per processor, here %d)\n"
+      "  -v, --verbose      report every file on standard error and close with a summary\n"
+      "      --no-progress  never draw the progress line (drawn only on a terminal)\n"
+      "  -h, --help         show this help and exit\n"
+      "\n"
+      "Exit status: 0 when every compressed file was decompressed, 1 when a file or a PATH failed,\n"
+      "2 on a usage error, 130 when interrupted.\n",
+      availableProcessors());
+}
+
+struct DecompressTotals {
+  std::atomic<uint64_t> files{0}, decompressed{0}, plain{0}, failed{0}, logicalBytes{0};
+};
+
+// Returns the file's logical size, for the progress line (a compressed file's data fork is empty).
+uint64_t decompressOne(const char *path, bool verify, bool userSpace, Console &console, DecompressTotals &totals) {
+  totals.files++;
+  StoredForm before;
+  if (!readStoredForm(path, &before)) {
+    totals.failed++;
+    report("%s: %s\n", path, strerror(errno));
+    return 0;
+  }
+  if (!before.compressed) {
+    totals.plain++;
+    if (console.verbose()) console.err("%s: not compressed, left as it is\n", path);
+    return before.logicalSize;
+  }
+  errno = 0;
+  if (decompressFile(path, verify, userSpace) != 0) {
+    totals.failed++;
+    report("%s: cannot decompress%s%s\n", path, errno ? ": " : "", errno ? strerror(errno) : "");
+    return before.logicalSize;
+  }
+  platform::Stat after;
+  if (platform::stat(path, &after) != 0 || (after.st_flags & kFlagCompressed) ||
+      static_cast<uint64_t>(after.st.st_size) != before.logicalSize) {
+    totals.failed++;
+    report("%s: still not a plain file of %llu bytes after decompression\n", path,
+           static_cast<unsigned long long>(before.logicalSize));
+    return before.logicalSize;
+  }
+  totals.decompressed++;
+  totals.logicalBytes += before.logicalSize;
+  if (console.verbose())
+    console.err("%s: decompressed (type %u), %llu -> %llu bytes\n", path, before.type,
+                static_cast<unsigned long long>(before.storedSize),
+                static_cast<unsigned long long>(before.logicalSize));
+  return before.logicalSize;
+}
+
+}  // namespace
+
+int decompressCommand(int argc, char **argv) {
+  const char *command = "decompress";
+  bool verify = false, userSpace = false, verbose = false, progressWanted = true;
+  int jobs = availableProcessors();
+  long number;
+  for (int c; (c = nextOption(command, argc, argv, "j:vh", kDecompressOptions)) != -1;) {
+    switch (c) {
+      case kVerify: verify = true; break;
+      case kUserSpace: userSpace = true; break;
+      case kNoProgress: progressWanted = false; break;
+      case 'j':
+        if (!parseNumber(optarg, 1, 1024, &number))
+          return usageError(command, std::string("invalid number of jobs '") + optarg + "': give 1 to 1024");
+        jobs = static_cast<int>(number);
+        break;
+      case 'v': verbose = true; break;
+      case 'h': printDecompressHelp(); return kExitSuccess;
+      default: return kExitUsage;
+    }
+  }
+  std::vector<std::string> paths = operands(argc, argv);
+  if (paths.empty()) return usageError(command, "missing PATH");
+
+  installInterruptHandler();
+  Console console(verbose, progressWanted);
+  DecompressTotals totals;
+  WalkResult walked;
+  double seconds;
+  {
+    ProgressMeter progress(console, "plzc decompress");
+    walked = forEachFile(
+        paths, WalkOptions{}, jobs,
+        [&](const WalkedFile &file) {
+          progress.fileDone(decompressOne(file.path.c_str(), verify, userSpace, console, totals));
+        },
+        [&](uint64_t files) { progress.setTotalFiles(files); });
+    seconds = progress.elapsedSeconds();
+  }
+  uint64_t failed = totals.failed + static_cast<uint64_t>(walked.failures);
+  if (verbose)
+    console.err(
+        "plzc decompress: %llu files in %.2f s: %llu decompressed (%s), %llu not compressed, %llu failed\n",
+        static_cast<unsigned long long>(totals.files.load()), seconds,
+        static_cast<unsigned long long>(totals.decompressed.load()), humanBytes(totals.logicalBytes).c_str(),
+        static_cast<unsigned long long>(totals.plain.load()), static_cast<unsigned long long>(failed));
+  if (walked.interrupted) {
+    report("interrupted; the files not reached are unchanged\n");
+    return kExitInterrupted;
+  }
+  return failed ? kExitFailure : kExitSuccess;
+}
+
+int catCommand(int argc, char **argv) {
+  const char *command = "cat";
+  static const option kCatOptions[] = {{"help", no_argument, nullptr, 'h'}, {nullptr, 0, nullptr, 0}};
+  for (int c; (c = nextOption(command, argc, argv, "h", kCatOptions)) != -1;) {
+    if (c != 'h') return kExitUsage;
+    printf(
+        "Usage: plzc cat PATH...\n"
+        "Write the data of each file to standard output, decompressing compressed files, in the\n"
+        "order given.\n"
+        "\n"
+        "  -h, --help  show this help and exit\n"
+        "\n"
+        "Exit status: 0 when every file was written whole, 1 otherwise, 2 on a usage error.\n");
+    return kExitSuccess;
+  }
+  std::vector<std::string> paths = operands(argc, argv);
+  if (paths.empty()) return usageError(command, "missing PATH");
+
+  int status = kExitSuccess;
+  for (const std::string &path : paths) {
+    struct stat st;
+    if (::stat(path.c_str(), &st) != 0) {
+      report("%s: %s\n", path.c_str(), strerror(errno));
+      status = kExitFailure;
+      continue;
+    }
+    if (!S_ISREG(st.st_mode)) {
+      report("%s: %s\n", path.c_str(), S_ISDIR(st.st_mode) ? "is a directory" : "not a regular file");
+      status = kExitFailure;
+      continue;
+    }
+    fflush(stdout);
+    // catFile reports a failure on standard error and nowhere else.
+    std::string problems = captureStderr([&] { catFile(path.c_str(), 0); });
+    reportText(problems);
+    if (!problems.empty()) {
+      report("%s: could not be read whole\n", path.c_str());
+      status = kExitFailure;
+    }
+  }
+  return status;
+}
+
+}  // namespace plzc
