@@ -29,21 +29,6 @@ namespace {
 
 const std::string kPrefix = "Common/StreamCompressor:[0-9]+: ";
 
-std::vector<uint8_t> compressibleBytes(size_t count, uint32_t seed) {
-  std::vector<uint8_t> bytes;
-  bytes.reserve(count + 64);
-  uint32_t state = seed;
-  while (bytes.size() < count) {
-    state = state * 1103515245 + 12345;
-    char line[64];
-    int n = snprintf(line, sizeof line, "record %u field %u tag t%u\n", static_cast<unsigned>(bytes.size()),
-                     (state >> 16) % 1000, (state >> 8) % 89);
-    bytes.insert(bytes.end(), line, line + n);
-  }
-  bytes.resize(count);
-  return bytes;
-}
-
 // Options built from key/value pairs; values are retained by the dictionary.
 PVDictionaryRef options(std::initializer_list<std::pair<PVStringRef, PVRef>> entries) {
   PVMutableDictionaryRef dictionary = PVDictionaryCreateMutable(0, kPVDictionaryRetainedValues);

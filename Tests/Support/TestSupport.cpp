@@ -90,6 +90,21 @@ std::vector<uint8_t> randomBytes(size_t count, uint32_t seed) {
   return bytes;
 }
 
+std::vector<uint8_t> compressibleBytes(size_t count, uint32_t seed) {
+  std::vector<uint8_t> bytes;
+  bytes.reserve(count + 64);
+  uint32_t state = seed;
+  while (bytes.size() < count) {
+    state = state * 1103515245 + 12345;
+    char line[64];
+    int n = snprintf(line, sizeof line, "entry %u value %u name item-%u\n", static_cast<unsigned>(bytes.size()),
+                     (state >> 16) % 1000, (state >> 8) % 97);
+    bytes.insert(bytes.end(), line, line + n);
+  }
+  bytes.resize(count);
+  return bytes;
+}
+
 std::vector<std::string> linuxAttributeNames(const std::string &path) {
   ssize_t size = llistxattr(path.c_str(), nullptr, 0);
   if (size <= 0) return {};

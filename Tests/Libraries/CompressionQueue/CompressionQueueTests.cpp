@@ -24,20 +24,6 @@ using ::testing::internal::GetCapturedStderr;
 
 namespace {
 
-std::vector<uint8_t> compressibleBytes(size_t count, uint32_t seed) {
-  std::vector<uint8_t> bytes;
-  uint32_t state = seed;
-  while (bytes.size() < count) {
-    state = state * 1103515245 + 12345;
-    char line[64];
-    int n = snprintf(line, sizeof line, "line %u of %u: %u\n", static_cast<unsigned>(bytes.size()), seed,
-                     (state >> 16) % 500);
-    bytes.insert(bytes.end(), line, line + n);
-  }
-  bytes.resize(count);
-  return bytes;
-}
-
 uint32_t flagsOf(const std::string &path) {
   platform::Stat st;
   EXPECT_EQ(platform::stat(path.c_str(), &st), 0);
