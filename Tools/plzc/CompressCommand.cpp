@@ -11,14 +11,15 @@ namespace plzc {
 
 namespace {
 
-enum LongOnly { kVerify = 256, kToc, kLargeForks, kNoProgress };
+enum LongOnly { kVerify = 256, kToc, kLargeForks, kNoProgress, kAsync };
 
 const option kOptions[] = {
     {"types", required_argument, nullptr, 't'},   {"level", required_argument, nullptr, 'l'},
     {"verify", no_argument, nullptr, kVerify},    {"toc", required_argument, nullptr, kToc},
     {"large-forks", no_argument, nullptr, kLargeForks}, {"jobs", required_argument, nullptr, 'j'},
     {"verbose", no_argument, nullptr, 'v'},       {"no-progress", no_argument, nullptr, kNoProgress},
-    {"help", no_argument, nullptr, 'h'},          {nullptr, 0, nullptr, 0},
+    {"async", no_argument, nullptr, kAsync},      {"help", no_argument, nullptr, 'h'},
+    {nullptr, 0, nullptr, 0},
 };
 
 void printHelp() {
@@ -36,6 +37,8 @@ void printHelp() {
       "      --toc=FILE     leave the files unchanged and write their compressed attributes to\n"
       "                     FILE, a table of contents (see 'plzc toc list')\n"
       "      --large-forks  also compress files over 64 MiB, into resource forks over 16 MiB\n"
+      "      --async        hand the files to the library's compression queue, which compresses\n"
+      "                     and writes them out on its own threads (not with --verify or --toc)\n"
       "  -j, --jobs=N       worker threads (default: one per processor, here %d)\n"
       "  -v, --verbose      report every file on standard error and close with a summary\n"
       "      --no-progress  never draw the progress line (drawn only on a terminal)\n"
@@ -83,6 +86,7 @@ int compressCommand(int argc, char **argv) {
         options.tocPath = optarg;
         break;
       case kLargeForks: options.largeForks = true; break;
+      case kAsync: options.async = true; break;
       case kNoProgress: progress = false; break;
       case 'v': verbose = true; break;
       case 'h': printHelp(); return kExitSuccess;
@@ -91,14 +95,18 @@ int compressCommand(int argc, char **argv) {
   }
   std::vector<std::string> paths = operands(argc, argv);
   if (paths.empty()) return usageError(command, "missing PATH");
+  if (options.async && (options.verify || !options.tocPath.empty()))
+    return usageError(command, "--async does not go with --verify or --toc");
 
   installInterruptHandler();
   Console console(verbose, progress);
-  CompressResult result = runCompress(options, paths, console, "plzc compress");
+  CompressResult result = options.async ? runCompressAsync(options, paths, console, "plzc compress")
+                                        : runCompress(options, paths, console, "plzc compress");
   if (result.setupFailed) return kExitFailure;
   if (verbose) {
-    console.err("plzc compress: %s, %llu files in %.2f s, %.1f MB/s, %d thread%s\n",
+    console.err("plzc compress: %s%s, %llu files in %.2f s, %.1f MB/s, %d thread%s\n",
                 options.tocPath.empty() ? "in place" : ("table of contents " + options.tocPath).c_str(),
+                options.async ? " through the compression queue" : "",
                 static_cast<unsigned long long>(result.totals.files), result.seconds,
                 megabytesPerSecond(result.bytesWalked, result.seconds), options.jobs,
                 options.jobs == 1 ? "" : "s");

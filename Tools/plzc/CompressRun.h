@@ -17,6 +17,7 @@ struct CompressOptions {
   std::string tocPath;        // empty: in place
   bool largeForks = false;
   int jobs = 1;
+  bool async = false;  // through the compression queue
 };
 
 struct CompressResult {
@@ -38,5 +39,11 @@ bool validTypeList(const std::string &list);
 // is reported and skipped.
 CompressResult runCompress(const CompressOptions &options, const std::vector<std::string> &paths, Console &console,
                            const char *progressLabel);
+
+// The same work through the library's compression queue, which compresses and writes the files
+// out on its own threads; the totals are read back from the files once the queue has finished.
+// Neither verify nor a table of contents applies.
+CompressResult runCompressAsync(const CompressOptions &options, const std::vector<std::string> &paths,
+                                Console &console, const char *progressLabel);
 
 }  // namespace plzc

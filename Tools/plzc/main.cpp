@@ -20,7 +20,7 @@ struct Subcommand {
 const Subcommand kSubcommands[] = {
     {"compress", plzc::compressCommand}, {"decompress", plzc::decompressCommand}, {"cat", plzc::catCommand},
     {"info", plzc::infoCommand},         {"volume", plzc::volumeCommand},         {"toc", plzc::tocCommand},
-    {"demo", plzc::demoCommand},
+    {"demo", plzc::demoCommand},         {"install", plzc::installCommand},
 };
 
 void printHelp() {
@@ -32,7 +32,10 @@ void printHelp() {
       "Commands:\n"
       "  compress [-t 3,4] [-l LEVEL] [--verify] [--toc FILE] [--large-forks] [-j N] PATH...\n"
       "                        compress files and whole trees in place (or into a table of\n"
-      "                        contents), with N worker threads\n"
+      "                        contents), with N worker threads; --async through the\n"
+      "                        compression queue\n"
+      "  install [--options FILE] [-t 3,4] [-l LEVEL] [--rules FILE] [--skip-macho TYPES] SRC... DEST\n"
+      "                        copy files and trees to DEST as new files, compressed on the way\n"
       "  decompress [--verify] [--user-space] PATH...\n"
       "                        turn compressed files back into plain files\n"
       "  cat PATH...           write the files' data to standard output\n"

@@ -1,0 +1,363 @@
+// plzc install and plzc compress --async as a user runs them: the real binary in a subprocess,
+// real files, real exit statuses and messages. The binary is $PLZC_BINARY, or Tools/plzc/plzc in
+// the build tree that holds this test program.
+#include <fcntl.h>
+#include <poll.h>
+#include <pty.h>
+#include <signal.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <cstring>
+#include <filesystem>
+#include <map>
+#include <set>
+#include <sstream>
+
+#include "Libraries/CompressData/DiskHeader.h"
+#include "Platform/ExtendedAttributes.h"
+#include "Platform/FileFlags.h"
+#include "Support/TestSupport.h"
+
+using namespace plzctest;
+using ::testing::AllOf;
+using ::testing::HasSubstr;
+using ::testing::Not;
+using ::testing::StartsWith;
+
+namespace {
+
+std::string plzcBinary() {
+  if (const char *configured = getenv("PLZC_BINARY")) return configured;
+  std::filesystem::path self = std::filesystem::read_symlink("/proc/self/exe");
+  return (self.parent_path().parent_path() / "Tools" / "plzc" / "plzc").string();
+}
+
+struct Finished {
+  int status = -1;  // exit status, or 128 + signal
+  std::string out, err;
+};
+
+// A running plzc with its standard output and error on pipes.
+class Process {
+ public:
+  explicit Process(const std::vector<std::string> &args) {
+    int outPipe[2], errPipe[2];
+    if (pipe2(outPipe, O_CLOEXEC) != 0 || pipe2(errPipe, O_CLOEXEC) != 0) return;
+    pid_ = fork();
+    if (pid_ == 0) {
+      dup2(outPipe[1], 1);
+      dup2(errPipe[1], 2);
+      execv(argv(args)[0], argv(args).data());
+      _exit(127);
+    }
+    close(outPipe[1]);
+    close(errPipe[1]);
+    outFd_ = outPipe[0];
+    errFd_ = errPipe[0];
+  }
+  ~Process() {
+    if (pid_ > 0 && !waited_) {
+      kill(pid_, SIGKILL);
+      waitpid(pid_, nullptr, 0);
+    }
+    if (outFd_ >= 0) close(outFd_);
+    if (errFd_ >= 0) close(errFd_);
+  }
+
+  // Reads until standard error holds text, or the time is up; true when it does.
+  bool waitForErr(const std::string &text, std::chrono::seconds limit) {
+    auto end = std::chrono::steady_clock::now() + limit;
+    while (run_.err.find(text) == std::string::npos) {
+      if (std::chrono::steady_clock::now() > end || !pump(100)) return false;
+    }
+    return true;
+  }
+  void signal(int number) { kill(pid_, number); }
+
+  Finished wait() {
+    while (pump(1000)) {
+    }
+    int status = 0;
+    waitpid(pid_, &status, 0);
+    waited_ = true;
+    run_.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    return run_;
+  }
+
+ private:
+  static std::vector<char *> argv(const std::vector<std::string> &args) {
+    static std::string binary = plzcBinary();
+    std::vector<char *> result{binary.data()};
+    for (const std::string &arg : args) result.push_back(const_cast<char *>(arg.c_str()));
+    result.push_back(nullptr);
+    return result;
+  }
+  // One round of reading; false once both pipes are closed.
+  bool pump(int timeoutMs) {
+    pollfd fds[2] = {{outFd_, POLLIN, 0}, {errFd_, POLLIN, 0}};
+    int open = (outFd_ >= 0) + (errFd_ >= 0);
+    if (open == 0) return false;
+    if (poll(fds, 2, timeoutMs) <= 0) return true;
+    char buffer[65536];
+    for (int i = 0; i < 2; i++) {
+      if (fds[i].fd < 0 || !(fds[i].revents & (POLLIN | POLLHUP))) continue;
+      ssize_t got = read(fds[i].fd, buffer, sizeof buffer);
+      if (got > 0) {
+        (i == 0 ? run_.out : run_.err).append(buffer, static_cast<size_t>(got));
+      } else {
+        close(fds[i].fd);
+        (i == 0 ? outFd_ : errFd_) = -1;
+      }
+    }
+    return true;
+  }
+
+  pid_t pid_ = -1;
+  int outFd_ = -1, errFd_ = -1;
+  bool waited_ = false;
+  Finished run_;
+};
+
+Finished plzc(const std::vector<std::string> &args) { return Process(args).wait(); }
+
+bool isCompressed(const std::string &path) {
+  platform::Stat st;
+  return platform::stat(path.c_str(), &st) == 0 && (st.st_flags & kFlagCompressed) != 0;
+}
+
+// The file's data as every reader sees it, read back through plzc cat.
+std::vector<uint8_t> catBytes(const std::string &path) {
+  Finished run = plzc({"cat", path});
+  EXPECT_EQ(run.status, 0) << path << ": " << run.err;
+  return {run.out.begin(), run.out.end()};
+}
+
+struct stat lstatOf(const std::string &path) {
+  struct stat st {};
+  EXPECT_EQ(lstat(path.c_str(), &st), 0) << path;
+  return st;
+}
+
+// The first bytes of a thin 64-bit Mach-O file of filetype 2 (MH_EXECUTE), followed by text
+// that would compress well.
+std::vector<uint8_t> machOExecutable() {
+  std::vector<uint8_t> bytes = {0xcf, 0xfa, 0xed, 0xfe, 0x07, 0x00, 0x00, 0x01, 0x03, 0x00, 0x00, 0x00,
+                                0x02, 0x00, 0x00, 0x00};
+  bytes.resize(32, 0);
+  std::vector<uint8_t> text = compressibleBytes(100 << 10, 9);
+  bytes.insert(bytes.end(), text.begin(), text.end());
+  return bytes;
+}
+
+constexpr time_t kOldTime = 981173106;  // 2001-02-03
+
+// A source tree of every kind the install copies, with what each file should become.
+struct Source {
+  std::string root;
+  std::map<std::string, std::vector<uint8_t>> files;  // relative path -> data
+  std::set<std::string> compressed;                   // relative paths expected compressed
+};
+
+Source makeSource(const ScratchDir &dir) {
+  Source source;
+  source.root = dir.file("src");
+  mkdir(source.root.c_str(), 0755);
+  mkdir((source.root + "/private").c_str(), 0755);
+  source.files = {
+      {"text.txt", compressibleBytes(300 << 10, 1)},
+      {"small.txt", compressibleBytes(3000, 2)},
+      {"noise.bin", randomBytes(200 << 10, 3)},
+      {"empty", {}},
+      {"._resource", compressibleBytes(50 << 10, 4)},
+      {"photo.jpg", compressibleBytes(80 << 10, 5)},
+      {"tool", machOExecutable()},
+      {"private/notes.txt", compressibleBytes(40 << 10, 6)},
+  };
+  source.compressed = {"text.txt", "small.txt", "private/notes.txt"};
+  for (const auto &[relative, bytes] : source.files) writeFile(source.root + "/" + relative, bytes);
+  EXPECT_EQ(chmod((source.root + "/tool").c_str(), 0755), 0);
+  EXPECT_EQ(chmod((source.root + "/private").c_str(), 0700), 0);
+  EXPECT_EQ(symlink("text.txt", (source.root + "/link").c_str()), 0);
+  timespec times[2] = {{kOldTime, 0}, {kOldTime, 0}};
+  for (const char *relative : {"text.txt", "noise.bin", "._resource", "private"})
+    EXPECT_EQ(utimensat(AT_FDCWD, (source.root + "/" + relative).c_str(), times, 0), 0);
+  return source;
+}
+
+TEST(PlzcInstall, CopiesATreeCompressedByTheRules) {
+  ScratchDir dir;
+  Source source = makeSource(dir);
+  std::string dest = dir.file("dest");
+  Finished run = plzc({"install", "-v", "--skip-macho", "MH_EXECUTE", "-j", "2", source.root, dest});
+  ASSERT_EQ(run.status, 0) << run.err;
+  EXPECT_THAT(run.err, HasSubstr("files       8: 3 compressed"));
+
+  for (const auto &[relative, bytes] : source.files) {
+    std::string path = dest + "/" + relative;
+    EXPECT_EQ(catBytes(path), bytes) << relative;
+    EXPECT_EQ(isCompressed(path), source.compressed.count(relative) == 1) << relative;
+    EXPECT_EQ(lstatOf(path).st_mode & 07777, lstatOf(source.root + "/" + relative).st_mode & 07777) << relative;
+  }
+}
+
+TEST(PlzcInstall, KeepsLinksModesAndTimes) {
+  ScratchDir dir;
+  Source source = makeSource(dir);
+  ASSERT_EQ(link((source.root + "/text.txt").c_str(), (source.root + "/second.txt").c_str()), 0);
+  std::string dest = dir.file("dest");
+  Finished run = plzc({"install", source.root, dest});
+  ASSERT_EQ(run.status, 0) << run.err;
+
+  struct stat link = lstatOf(dest + "/link");
+  EXPECT_TRUE(S_ISLNK(link.st_mode));
+  EXPECT_EQ(std::filesystem::read_symlink(dest + "/link"), "text.txt");
+  EXPECT_EQ(lstatOf(dest + "/second.txt").st_ino, lstatOf(dest + "/text.txt").st_ino);
+  EXPECT_EQ(lstatOf(dest + "/private").st_mode & 07777, 0700u);
+  EXPECT_TRUE(S_ISDIR(lstatOf(dest + "/private").st_mode));
+  for (const char *relative : {"text.txt", "noise.bin", "._resource", "private"})
+    EXPECT_EQ(lstatOf(dest + "/" + relative).st_mtime, kOldTime) << relative;
+}
+
+TEST(PlzcInstall, MachOExecutableIsCompressedWithoutSkipOption) {
+  ScratchDir dir;
+  std::string source = writeFile(dir.file("tool"), machOExecutable());
+  Finished run = plzc({"install", source, dir.file("copied")});
+  ASSERT_EQ(run.status, 0) << run.err;
+  EXPECT_TRUE(isCompressed(dir.file("copied")));
+  EXPECT_EQ(catBytes(dir.file("copied")), machOExecutable());
+}
+
+TEST(PlzcInstall, RulesFileExcludesFiles) {
+  ScratchDir dir;
+  mkdir(dir.file("src").c_str(), 0755);
+  std::vector<uint8_t> text = compressibleBytes(60 << 10, 7);
+  writeFile(dir.file("src/keep.log"), text);
+  writeFile(dir.file("src/plain.dat"), text);
+  writeFile(dir.file("rules.plist"),
+            "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><array><dict>"
+            "<key>RuleType</key><string>Exclude</string><key>PathEndsWithString</key><string>.dat</string>"
+            "</dict></array></plist>\n");
+  mkdir(dir.file("dest").c_str(), 0755);
+  Finished run = plzc({"install", "--rules", dir.file("rules.plist"), dir.file("src/keep.log"),
+                       dir.file("src/plain.dat"), dir.file("dest")});
+  ASSERT_EQ(run.status, 0) << run.err;
+  EXPECT_TRUE(isCompressed(dir.file("dest/keep.log")));
+  EXPECT_FALSE(isCompressed(dir.file("dest/plain.dat")));
+  EXPECT_EQ(catBytes(dir.file("dest/plain.dat")), text);
+}
+
+TEST(PlzcInstall, OptionsFileRulesApply) {
+  ScratchDir dir;
+  mkdir(dir.file("src").c_str(), 0755);
+  std::vector<uint8_t> text = compressibleBytes(60 << 10, 8);
+  writeFile(dir.file("src/kept.txt"), text);
+  writeFile(dir.file("src/packed.log"), text);
+  writeFile(dir.file("options.plist"),
+            "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
+            "<key>CompressionLevel</key><integer>9</integer><key>CompressionRules</key><array><dict>"
+            "<key>RuleType</key><string>Exclude</string><key>PathEndsWithString</key><string>.txt</string>"
+            "</dict></array></dict></plist>\n");
+  Finished run = plzc({"install", "--options", dir.file("options.plist"), dir.file("src"), dir.file("dest")});
+  ASSERT_EQ(run.status, 0) << run.err;
+  EXPECT_FALSE(isCompressed(dir.file("dest/kept.txt")));
+  EXPECT_TRUE(isCompressed(dir.file("dest/packed.log")));
+  EXPECT_EQ(catBytes(dir.file("dest/kept.txt")), text);
+  EXPECT_EQ(catBytes(dir.file("dest/packed.log")), text);
+}
+
+TEST(PlzcInstall, QueueFailureNamesTheFile) {
+  if (!runningAsRoot()) GTEST_SKIP() << "mounting a small volume needs root";
+  ScratchDir dir;
+  TemporaryMount volume = TemporaryMount::ext4WithoutLargeAttributes(dir.path());
+  if (!volume.mounted()) GTEST_SKIP() << "no ext4 volume could be mounted";
+  std::string source = writeFile(dir.file("big.txt"), compressibleBytes(300 << 10, 10));
+  std::string dest = volume.mountPoint() + "/big.txt";
+  Finished run = plzc({"install", source, dest});
+  EXPECT_EQ(run.status, 1);
+  EXPECT_THAT(run.err, HasSubstr("the stream queue failed"));
+  EXPECT_THAT(run.err, HasSubstr("failed: " + dest));
+}
+
+TEST(PlzcInstall, MissingSourceFails) {
+  ScratchDir dir;
+  Finished run = plzc({"install", dir.file("absent"), dir.file("dest")});
+  EXPECT_EQ(run.status, 1);
+  EXPECT_THAT(run.err, HasSubstr(dir.file("absent") + ": No such file or directory"));
+}
+
+TEST(PlzcInstall, UsageErrors) {
+  ScratchDir dir;
+  writeFile(dir.file("bad.plist"), "<plist version=\"1.0\"><dict><key>x</key></plist>");
+  writeFile(dir.file("array.plist"), "<plist version=\"1.0\"><array/></plist>");
+  writeFile(dir.file("file"), "x");
+  struct Case {
+    std::vector<std::string> args;
+    const char *message;
+  } cases[] = {
+      {{"install", "--bogus", dir.file("file"), dir.file("d")}, "unknown option '--bogus'"},
+      {{"install", "--options", dir.file("bad.plist"), dir.file("file"), dir.file("d")}, "not a well-formed"},
+      {{"install", "--options", dir.file("array.plist"), dir.file("file"), dir.file("d")}, "must hold a dictionary"},
+      {{"install", "--options", dir.file("none.plist"), dir.file("file"), dir.file("d")}, "cannot read"},
+      {{"install", "--rules", dir.file("bad.plist"), dir.file("file"), dir.file("d")}, "not a well-formed"},
+      {{"install", "-t", "5", dir.file("file"), dir.file("d")}, "invalid type list"},
+      {{"install", dir.file("file")}, "missing DEST"},
+  };
+  for (const Case &c : cases) {
+    Finished run = plzc(c.args);
+    EXPECT_EQ(run.status, 2) << c.args[1];
+    EXPECT_THAT(run.err, HasSubstr(c.message)) << c.args[1];
+  }
+  EXPECT_FALSE(std::filesystem::exists(dir.file("d")));
+}
+
+TEST(PlzcInstall, InvalidMachOTypeFailsSetUp) {
+  ScratchDir dir;
+  writeFile(dir.file("file"), "x");
+  Finished run = plzc({"install", "--skip-macho", "MH_NOTHING", dir.file("file"), dir.file("d")});
+  EXPECT_EQ(run.status, 1);
+  EXPECT_FALSE(std::filesystem::exists(dir.file("d")));
+}
+
+TEST(PlzcCompressAsync, SameEndStateAsCompress) {
+  ScratchDir dir;
+  for (const char *name : {"sync", "async"}) {
+    std::string root = dir.file(name);
+    mkdir(root.c_str(), 0755);
+    mkdir((root + "/sub").c_str(), 0755);
+    writeFile(root + "/large.txt", compressibleBytes(300 << 10, 1));
+    writeFile(root + "/small.txt", compressibleBytes(3000, 2));
+    writeFile(root + "/noise.bin", randomBytes(100 << 10, 3));
+    writeFile(root + "/empty", std::string());
+    writeFile(root + "/sub/more.txt", compressibleBytes(70 << 10, 4));
+  }
+  Finished sync = plzc({"compress", "-v", dir.file("sync")});
+  Finished async = plzc({"compress", "-v", "--async", dir.file("async")});
+  ASSERT_EQ(sync.status, 0) << sync.err;
+  ASSERT_EQ(async.status, 0) << async.err;
+  EXPECT_THAT(async.err, HasSubstr("through the compression queue"));
+  for (const char *relative : {"large.txt", "small.txt", "noise.bin", "empty", "sub/more.txt"}) {
+    std::string a = dir.file(std::string("sync/") + relative), b = dir.file(std::string("async/") + relative);
+    EXPECT_EQ(isCompressed(a), isCompressed(b)) << relative;
+    EXPECT_EQ(catBytes(a), catBytes(b)) << relative;
+    Finished infoA = plzc({"info", a}), infoB = plzc({"info", b});
+    EXPECT_EQ(infoA.out.substr(0, infoA.out.rfind(a)), infoB.out.substr(0, infoB.out.rfind(b))) << relative;
+  }
+  EXPECT_TRUE(isCompressed(dir.file("async/large.txt")));
+}
+
+TEST(PlzcCompressAsync, RejectsVerify) {
+  ScratchDir dir;
+  writeFile(dir.file("f"), "x");
+  Finished run = plzc({"compress", "--async", "--verify", dir.file("f")});
+  EXPECT_EQ(run.status, 2);
+  EXPECT_THAT(run.err, HasSubstr("--async does not go with --verify"));
+}
+
+}  // namespace

@@ -1,0 +1,31 @@
+// One run of plzc install: sources copied to a destination as new files written through the
+// stream pipeline, which compresses them by its rules on worker threads.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "Console.h"
+#include "PropertyValue.h"
+#include "Totals.h"
+
+namespace plzc {
+
+struct InstallResult {
+  Totals totals;                        // regular files; with verbose, how they were stored
+  uint64_t directories = 0, symlinks = 0, hardLinks = 0, plainCopies = 0, specials = 0;
+  uint64_t bytes = 0;                   // logical bytes of the files written
+  double seconds = 0;
+  bool setupFailed = false;             // nothing was done (reported)
+  bool queueFailed = false;             // the queue's finish failed (reported)
+  bool interrupted = false;
+  std::vector<std::string> failedFiles; // destination files named in failure messages
+};
+
+// Copies each source (file, symbolic link, directory tree) to dest: into dest when it is a
+// directory, as dest when there is one source and dest is not a directory. queueOptions (not
+// released) configures the stream queue; jobs threads feed it.
+InstallResult runInstall(const std::vector<std::string> &sources, const std::string &dest, PVDictionaryRef queueOptions,
+                         int jobs, Console &console);
+
+}  // namespace plzc
