@@ -15,6 +15,7 @@
 #include "Libraries/CompressData/DiskHeader.h"
 #include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
+#include "Platform/Syscalls.h"
 #include "Platform/ThrottledIO.h"
 #include "Plenzo.h"
 #include "Support/TestSupport.h"
@@ -363,6 +364,65 @@ TEST_F(StreamCompressor, ThrottledItemsLeaveTheirThreadsAsTheyFoundThem) {
   for (const Seen &one : seen) {
     EXPECT_NE(one.io >> 13, 3);
     EXPECT_EQ(one.nice, niceBefore);
+  }
+}
+
+TEST_F(StreamCompressor, InPlaceFailuresLeaveTheFileAsItWas) {
+  // Existing files through a queue in in-place mode, one failure at a time.
+  std::vector<uint8_t> text = compressibleBytes(400000, 15);
+  struct Case {
+    const char *name;
+    sys::Call call;
+    uint64_t nth;
+    const char *message;
+  } cases[] = {
+      {"truncation", sys::Call::Truncate, 1, "Error: ftruncate failed for "},
+      {"lock", sys::Call::Fstat, 1, "Error: PLZCLockFile failed for "},
+      {"status", sys::Call::Fstat, 2, "Error: stat failed for "},
+  };
+  for (const Case &c : cases) {
+    SCOPED_TRACE(c.name);
+    std::string path = writeFile(dir.file(c.name), text);
+    StreamCompressorQueue *queue = CreateStreamCompressorQueue();
+    StreamCompressorQueueSetInPlace(queue, 1);
+    int fd = open(path.c_str(), O_RDONLY);
+    ::StreamCompressor *stream = CreateStreamCompressor(fd, path.c_str(), nullptr, queue, static_cast<int64_t>(text.size()));
+    ASSERT_NE(stream, nullptr);
+    ASSERT_EQ(WriteToStreamCompressor(stream, text.data(), text.size()), static_cast<int64_t>(text.size()));
+    // Armed once the data is in: the next calls of that kind are the write-out's.
+    sys::armFault(c.call, c.nth, EIO);
+    CloseStreamCompressor(stream);
+    CaptureStderr();
+    EXPECT_EQ(FinishStreamCompressorQueue(queue), -1);
+    EXPECT_EQ(errno, EIO);
+    EXPECT_THAT(GetCapturedStderr(), HasSubstr(std::string(c.message) + path + ": Input/output error"));
+    sys::clearFaults();
+    close(fd);
+    EXPECT_EQ(readFile(path), text);  // the data fork is intact
+    EXPECT_EQ(flagsOf(path), 0u);     // and the file is not marked compressed
+  }
+}
+
+TEST_F(StreamCompressor, InPlaceAttributesThatCannotBeStoredLeaveTheFileAlone) {
+  if (!runningAsRoot()) GTEST_SKIP() << "mounting a file system needs root";
+  TemporaryMount ext4 = TemporaryMount::ext4WithoutLargeAttributes(dir.path());
+  ASSERT_TRUE(ext4.mounted());
+  std::vector<uint8_t> text = compressibleBytes(2 << 20, 16);
+  for (bool ignore : {true, false}) {
+    PVDictionaryRef opts = options({{kPLZCIgnoreXattrErrors, PVRetain(ignore ? kPVBooleanTrue : kPVBooleanFalse)}});
+    StreamCompressorQueue *queue = CreateCompressionQueue(nullptr, nullptr, nullptr, nullptr, opts);
+    PVRelease(opts);
+    std::string path = writeFile(ext4.mountPoint() + (ignore ? "/ignored" : "/failed"), text);
+    CaptureStderr();
+    EXPECT_EQ(CompressFile(queue, path.c_str(), nullptr), 1);
+    int finished = FinishStreamCompressorQueue(queue);
+    std::string printed = GetCapturedStderr();
+    EXPECT_EQ(finished, ignore ? 0 : -1);
+    EXPECT_THAT(printed, HasSubstr(ignore ? "Compressed data for " + path + " could not be written: No space left on device"
+                                          : "Error: applyTocDictToFd failed for " + path));
+    EXPECT_EQ(readFile(path), text);
+    EXPECT_EQ(flagsOf(path), 0u);
+    EXPECT_TRUE(linuxAttributeNames(path).empty());
   }
 }
 
