@@ -148,6 +148,47 @@ TEST(ThrottlingAllocator, HighSoftLimitIsLoweredAndLeavesTheSmallestBudget) {
   });
 }
 
+TEST(ThrottlingAllocator, DescriptorBudgetForSoftLimitsNear10240) {
+  if (geteuid() != 0) GTEST_SKIP() << "raising the hard descriptor limit needs root";
+  struct {
+    rlim_t soft;
+    uint64_t newSoft, budget;
+  } cases[] = {{10200, 10240, 40}, {10240, 10240, 10}};
+  for (const auto &c : cases) {
+    inChild([&] {
+      struct rlimit limit = {c.soft, 10240};
+      if (setrlimit(RLIMIT_NOFILE, &limit) != 0) return 1;
+      int fd = waitThenDupOrOpen(nullptr, 0);
+      getrlimit(RLIMIT_NOFILE, &limit);
+      if (limit.rlim_cur != c.newSoft) return 2;
+      if (throttlingDescriptorBudget() != c.budget) return 3;
+      return closeAndSignal(fd) == 0 ? 0 : 4;
+    });
+  }
+}
+
+TEST(ThrottlingAllocator, TooManyOpenFilesIsWaitedOutNotReported) {
+  inChild([] {
+    int first = waitThenDupOrOpen(nullptr, 0);  // sets the budget up
+    closeAndSignal(first);
+    // Use up the process's descriptors outside the budget.
+    std::vector<int> filler;
+    for (int fd; (fd = dup(0)) >= 0;) filler.push_back(fd);
+    if (errno != EMFILE) return 1;
+    std::atomic<int> got{-2};
+    std::thread opener([&] { got = waitThenDupOrOpen("/dev/null", -1); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    if (got != -2) return 2;  // it must still be waiting, not failed
+    for (int i = 0; i < 4; i++) {
+      close(filler.back());
+      filler.pop_back();
+    }
+    opener.join();  // retried within its 5-second wait
+    if (got < 0) return 3;
+    return closeAndSignal(got) == 0 ? 0 : 4;
+  });
+}
+
 TEST(ThrottlingAllocator, OpenFailureIsReportedAndLeavesTheCountAlone) {
   testing::internal::CaptureStderr();
   errno = 0;
