@@ -110,7 +110,7 @@ class HeaderTest : public ::testing::Test {
     auto *self = static_cast<HeaderTest *>(fh->priv);
     if (offset != self->position) return -1;
     int64_t n = std::min<int64_t>(count, static_cast<int64_t>(self->bytes.size()) - offset);
-    memcpy(buffer, self->bytes.data() + offset, static_cast<size_t>(n));
+    if (n > 0) memcpy(buffer, self->bytes.data() + offset, static_cast<size_t>(n));
     self->position += n;
     return n;
   }
