@@ -171,12 +171,23 @@ TEST(ThrottlingAllocator, TooManyOpenFilesIsWaitedOutNotReported) {
   inChild([] {
     int first = waitThenDupOrOpen(nullptr, 0);  // sets the budget up
     closeAndSignal(first);
+    // The opener thread exists before the descriptors run out: starting a thread (and the
+    // sanitizers' checks when it starts) may itself need one.
+    std::atomic<bool> go{false};
+    std::atomic<int> got{-2};
+    std::thread opener([&] {
+      while (!go) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+      got = waitThenDupOrOpen("/dev/null", -1);
+    });
     // Use up the process's descriptors outside the budget.
     std::vector<int> filler;
+    filler.reserve(1 << 16);
     for (int fd; (fd = dup(0)) >= 0;) filler.push_back(fd);
-    if (errno != EMFILE) return 1;
-    std::atomic<int> got{-2};
-    std::thread opener([&] { got = waitThenDupOrOpen("/dev/null", -1); });
+    if (errno != EMFILE) {
+      fprintf(stderr, "filling descriptors stopped with %s after %zu\n", strerror(errno), filler.size());
+      return 1;
+    }
+    go = true;
     std::this_thread::sleep_for(std::chrono::milliseconds(300));
     if (got != -2) return 2;  // it must still be waiting, not failed
     for (int i = 0; i < 4; i++) {
