@@ -527,9 +527,18 @@ StreamCompressor *CreateStreamCompressor(int fd, const char *path, const char *p
   stream->fd = duplicate;
   stream->path = pathCopy;
   stream->prefix = prefixCopy;
+  stream->pool = pool;
+  if (!compress && !(stream->handle = _SCHandleForPool(stream))) {
+    releaseDataPool(pool);
+    free(pathCopy);
+    free(prefixCopy);
+    delete stream;
+    closeAndSignal(duplicate);
+    errno = ENOMEM;
+    return nullptr;
+  }
   stream->queue = queue;
   queue->refCount.fetch_add(1);
-  stream->pool = pool;
   retainDataPool(pool);
   stream->refCount.fetch_add(1);  // the pipeline's reference
 
@@ -537,7 +546,6 @@ StreamCompressor *CreateStreamCompressor(int fd, const char *path, const char *p
     queue->enqueued.fetch_add(1);
     workGroupAsync(queue->group, concurrentQueue, stream, _SCCompressFile);
   } else {
-    stream->handle = _SCHandleForPool(stream);
     _SCEnqueueWriter(stream, expectedSize > kDirectRouteThreshold);
   }
   return stream;
