@@ -145,7 +145,7 @@ class ByteSource {
   size_t used_ = kLineBytes;
 };
 
-struct FileSpec {
+struct FilePlan {
   std::string name;
   uint64_t size = 0;
   Content content = Content::kText;
@@ -163,7 +163,7 @@ struct FileSpec {
 };
 
 // Items the pipeline runs for the file: compression and write-out, or the write-out alone.
-int itemsFor(const FileSpec &spec) { return spec.size > 0 && !spec.ruledOut ? 2 : 1; }
+int itemsFor(const FilePlan &plan) { return plan.size > 0 && !plan.ruledOut ? 2 : 1; }
 
 uint32_t mix(uint32_t value) {
   value ^= value >> 16;
@@ -180,19 +180,19 @@ uint32_t mix(uint32_t value) {
 // excluded suffix, which goes straight to the I/O queue). Large files come in adjacent groups
 // of groupSize spread over the list, so that several callers write large files at once while
 // the others write small ones.
-std::vector<FileSpec> makeWorkload(int smallFiles, int largeFiles, int groupSize) {
-  std::vector<FileSpec> specs;
+std::vector<FilePlan> makeWorkload(int smallFiles, int largeFiles, int groupSize) {
+  std::vector<FilePlan> plans;
   for (int i = 0; i < smallFiles; i++) {
-    FileSpec spec;
+    FilePlan plan;
     uint32_t r = mix(static_cast<uint32_t>(i) + 1);
-    spec.seed = r;
-    spec.size = r % 20481;
+    plan.seed = r;
+    plan.size = r % 20481;
     char name[32];
     switch (r % 20) {
       case 0:
       case 1:
-        spec.content = Content::kText;
-        spec.ruledOut = true;
+        plan.content = Content::kText;
+        plan.ruledOut = true;
         snprintf(name, sizeof name, "s%05d.png", i);
         break;
       case 2:
@@ -201,69 +201,69 @@ std::vector<FileSpec> makeWorkload(int smallFiles, int largeFiles, int groupSize
       case 5:
       case 6:
       case 7:
-        spec.content = Content::kRandom;
+        plan.content = Content::kRandom;
         snprintf(name, sizeof name, "s%05d.bin", i);
         break;
       default:
-        spec.content = Content::kText;
+        plan.content = Content::kText;
         snprintf(name, sizeof name, "s%05d.txt", i);
         break;
     }
-    if (i % 50 == 7) spec.size = 0;
+    if (i % 50 == 7) plan.size = 0;
     if (i % 250 == 3) {
-      spec.content = Content::kExecutable;
-      spec.ruledOut = false;
-      spec.size = std::max<uint64_t>(spec.size, 28);  // the whole header, or the filter cannot tell
+      plan.content = Content::kExecutable;
+      plan.ruledOut = false;
+      plan.size = std::max<uint64_t>(plan.size, 28);  // the whole header, or the filter cannot tell
       snprintf(name, sizeof name, "s%05d", i);
     }
     // The edges of the stored single chunk, for random bytes.
-    if (i % 500 == 11) spec.content = Content::kRandom, spec.size = kLargestInlineRandomFile, spec.ruledOut = false;
-    if (i % 500 == 12) spec.content = Content::kRandom, spec.size = kLargestInlineRandomFile + 1, spec.ruledOut = false;
-    if (spec.content == Content::kRandom && !spec.ruledOut) snprintf(name, sizeof name, "s%05d.bin", i);
-    spec.name = name;
-    spec.piece = i % 13 == 0 ? 7 : 1 + (r >> 8) % 8192;
-    specs.push_back(spec);
+    if (i % 500 == 11) plan.content = Content::kRandom, plan.size = kLargestInlineRandomFile, plan.ruledOut = false;
+    if (i % 500 == 12) plan.content = Content::kRandom, plan.size = kLargestInlineRandomFile + 1, plan.ruledOut = false;
+    if (plan.content == Content::kRandom && !plan.ruledOut) snprintf(name, sizeof name, "s%05d.bin", i);
+    plan.name = name;
+    plan.piece = i % 13 == 0 ? 7 : 1 + (r >> 8) % 8192;
+    plans.push_back(plan);
   }
 
-  std::vector<FileSpec> large;
+  std::vector<FilePlan> large;
   for (int k = 0; k < largeFiles; k++) {
-    FileSpec spec;
-    spec.seed = mix(0x10000u + static_cast<uint32_t>(k));
+    FilePlan plan;
+    plan.seed = mix(0x10000u + static_cast<uint32_t>(k));
     // The smallest is one byte over the ring; the others end at odd places in it.
-    spec.size = kDataPoolMaxCapacity + 1 + static_cast<uint64_t>(k) * 524287;
+    plan.size = kDataPoolMaxCapacity + 1 + static_cast<uint64_t>(k) * 524287;
     static const size_t kPieces[] = {kMiB, kMiB + 13, 65536, 3 * kMiB - 1, 200001};
-    spec.piece = kPieces[k % 5];
+    plan.piece = kPieces[k % 5];
     char name[32];
     switch (k % 3) {
       case 0:
-        spec.content = Content::kText;  // compressible, but over type 4's 64 MiB cap
+        plan.content = Content::kText;  // compressible, but over type 4's 64 MiB cap
         snprintf(name, sizeof name, "L%02d.txt", k);
         break;
       case 1:
-        spec.content = Content::kRandom;
+        plan.content = Content::kRandom;
         snprintf(name, sizeof name, "L%02d.bin", k);
         break;
       default:
-        spec.content = Content::kRandom;
-        spec.ruledOut = true;  // not compressed by the rules: straight to the I/O queue
+        plan.content = Content::kRandom;
+        plan.ruledOut = true;  // not compressed by the rules: straight to the I/O queue
         snprintf(name, sizeof name, "L%02d.zip", k);
         break;
     }
-    spec.name = name;
-    large.push_back(spec);
+    plan.name = name;
+    large.push_back(plan);
   }
   // Large files are never compressed: over 64 MiB type 4 refuses them at once.
-  for (FileSpec &spec : specs)
-    spec.expectCompressed = spec.size > 0 && !spec.ruledOut && spec.content != Content::kExecutable &&
-                            (spec.content == Content::kText || spec.size <= kLargestInlineRandomFile);
+  for (FilePlan &plan : plans)
+    plan.expectCompressed = plan.size > 0 && !plan.ruledOut && plan.content != Content::kExecutable &&
+                            (plan.content == Content::kText || plan.size <= kLargestInlineRandomFile);
   size_t groups = static_cast<size_t>((largeFiles + groupSize - 1) / groupSize);
-  size_t stride = specs.size() / (groups + 1) + 1;
+  size_t stride = plans.size() / (groups + 1) + 1;
   for (int k = 0; k < largeFiles; k++) {
     size_t at =
-        std::min(specs.size(), static_cast<size_t>(k / groupSize + 1) * stride + static_cast<size_t>(k % groupSize));
-    specs.insert(specs.begin() + static_cast<std::ptrdiff_t>(at), large[static_cast<size_t>(k)]);
+        std::min(plans.size(), static_cast<size_t>(k / groupSize + 1) * stride + static_cast<size_t>(k % groupSize));
+    plans.insert(plans.begin() + static_cast<std::ptrdiff_t>(at), large[static_cast<size_t>(k)]);
   }
-  return specs;
+  return plans;
 }
 
 int openDescriptorCount() {
@@ -278,31 +278,31 @@ int openDescriptorCount() {
 
 // Writes one new file through the queue, as an installer would: create, hand over the
 // descriptor, write the bytes in pieces, close.
-void writeThrough(StreamCompressorQueue *queue, const std::string &dir, FileSpec &spec, std::vector<uint8_t> &buffer) {
-  std::string path = dir + "/" + spec.name;
+void writeThrough(StreamCompressorQueue *queue, const std::string &dir, FilePlan &plan, std::vector<uint8_t> &buffer) {
+  std::string path = dir + "/" + plan.name;
   int fd = open(path.c_str(), O_RDWR | O_CREAT | O_EXCL, 0644);
   if (fd < 0) return;
   StreamCompressor *stream =
-      CreateStreamCompressor(fd, path.c_str(), dir.c_str(), queue, static_cast<int64_t>(spec.size));
+      CreateStreamCompressor(fd, path.c_str(), dir.c_str(), queue, static_cast<int64_t>(plan.size));
   close(fd);  // the stream has its own descriptor
   if (!stream) return;
-  spec.streamCreated = true;
-  if (buffer.size() < spec.piece) buffer.resize(spec.piece);
+  plan.streamCreated = true;
+  if (buffer.size() < plan.piece) buffer.resize(plan.piece);
   MD5_CTX md5;
   MD5Init(&md5);
-  ByteSource source(spec.content, spec.seed);
+  ByteSource source(plan.content, plan.seed);
   uint64_t written = 0;
-  while (written < spec.size) {
-    size_t n = static_cast<size_t>(std::min<uint64_t>(spec.piece, spec.size - written));
+  while (written < plan.size) {
+    size_t n = static_cast<size_t>(std::min<uint64_t>(plan.piece, plan.size - written));
     source.fill(buffer.data(), n);
     MD5Update(&md5, buffer.data(), n);
     if (WriteToStreamCompressor(stream, buffer.data(), n) != static_cast<int64_t>(n)) break;
     written += n;
   }
-  spec.allWritten = written == spec.size;
-  MD5Final(spec.digest, &md5);
-  spec.closeResult = CloseStreamCompressor(stream);
-  spec.closeErrno = spec.closeResult == 0 ? 0 : errno;
+  plan.allWritten = written == plan.size;
+  MD5Final(plan.digest, &md5);
+  plan.closeResult = CloseStreamCompressor(stream);
+  plan.closeErrno = plan.closeResult == 0 ? 0 : errno;
 }
 
 // A queue as an installer makes it: Mach-O executables stay uncompressed. The filter reads the
@@ -331,7 +331,7 @@ struct RunResult {
 
 // Writes every file from kCallerThreads threads that take the next file in list order, then
 // finishes the queue and reads its counters.
-RunResult runWorkload(std::vector<FileSpec> &specs, const std::string &dir) {
+RunResult runWorkload(std::vector<FilePlan> &plans, const std::string &dir) {
   RunResult result;
   StreamCompressorQueue *queue = createQueue();
   if (!queue) return result;
@@ -350,7 +350,7 @@ RunResult runWorkload(std::vector<FileSpec> &specs, const std::string &dir) {
     fprintf(stderr,
             "pipeline stuck after %lld s: %zu of %zu files closed by the callers; enqueued %d, started %d, "
             "completed %d; %" PRIu64 " bytes charged, %d descriptors held\n",
-            static_cast<long long>(kTimeLimit.count()), filesClosed.load(), specs.size(), queue->enqueued.load(),
+            static_cast<long long>(kTimeLimit.count()), filesClosed.load(), plans.size(), queue->enqueued.load(),
             queue->started.load(), queue->completed.load(), throttlingMemoryCharged(), throttlingDescriptorsHeld());
     abort();
   });
@@ -359,8 +359,8 @@ RunResult runWorkload(std::vector<FileSpec> &specs, const std::string &dir) {
   for (int t = 0; t < kCallerThreads; t++)
     callers.emplace_back([&] {
       std::vector<uint8_t> buffer;
-      for (size_t i; (i = nextFile.fetch_add(1)) < specs.size(); filesClosed++)
-        writeThrough(queue, dir, specs[i], buffer);
+      for (size_t i; (i = nextFile.fetch_add(1)) < plans.size(); filesClosed++)
+        writeThrough(queue, dir, plans[i], buffer);
     });
   for (std::thread &caller : callers) caller.join();
   auto written = std::chrono::steady_clock::now();
@@ -394,39 +394,39 @@ std::string hex(const uint8_t *bytes, size_t count) {
 // Checks every file as any reader sees it: its logical bytes, whether it ended compressed, its
 // size, flags and compression attributes. Returns the number of files that passed; reports the
 // first few that did not.
-int verifyFiles(const std::vector<FileSpec> &specs, const std::string &dir) {
+int verifyFiles(const std::vector<FilePlan> &plans, const std::string &dir) {
   int passed = 0, reported = 0;
-  for (const FileSpec &spec : specs) {
-    std::string path = dir + "/" + spec.name;
+  for (const FilePlan &plan : plans) {
+    std::string path = dir + "/" + plan.name;
     std::string problem;
     platform::Stat status{};
     uint8_t digest[MD5_DIGEST_LENGTH] = {};
-    if (!spec.streamCreated || !spec.allWritten || spec.closeResult != 0) {
-      problem = "stream created " + std::to_string(spec.streamCreated) + ", all written " +
-                std::to_string(spec.allWritten) + ", close " + std::to_string(spec.closeResult) + " (" +
-                strerror(spec.closeErrno) + ")";
+    if (!plan.streamCreated || !plan.allWritten || plan.closeResult != 0) {
+      problem = "stream created " + std::to_string(plan.streamCreated) + ", all written " +
+                std::to_string(plan.allWritten) + ", close " + std::to_string(plan.closeResult) + " (" +
+                strerror(plan.closeErrno) + ")";
     } else if (platform::stat(path.c_str(), &status) != 0) {
       problem = std::string("stat: ") + strerror(errno);
     } else if (checksumFile(path.c_str(), digest) != 1) {
       problem = "checksumFile failed";
-    } else if (memcmp(digest, spec.digest, sizeof digest) != 0) {
+    } else if (memcmp(digest, plan.digest, sizeof digest) != 0) {
       problem = "logical data differs: MD5 " + hex(digest, sizeof digest) + ", written " +
-                hex(spec.digest, sizeof spec.digest);
+                hex(plan.digest, sizeof plan.digest);
     } else {
       ssize_t header = platform::getxattr(path.c_str(), kDecmpfsXattrName, nullptr, 0, 0, 0);
       int headerErrno = errno;
       ssize_t fork = platform::getxattr(path.c_str(), kResourceForkXattrName, nullptr, 0, 0, 0);
       int forkErrno = errno;
       bool compressed = (status.st_flags & kCompressedFlag) != 0;
-      if (compressed != spec.expectCompressed) {
+      if (compressed != plan.expectCompressed) {
         problem = std::string("ended ") + (compressed ? "compressed" : "plain") + ", expected " +
-                  (spec.expectCompressed ? "compressed" : "plain");
-      } else if (status.st_flags != (spec.expectCompressed ? kCompressedFlag : 0u)) {
+                  (plan.expectCompressed ? "compressed" : "plain");
+      } else if (status.st_flags != (plan.expectCompressed ? kCompressedFlag : 0u)) {
         problem = "flags " + std::to_string(status.st_flags);
-      } else if (spec.expectCompressed && (status.st.st_size != 0 || header < 16)) {
+      } else if (plan.expectCompressed && (status.st.st_size != 0 || header < 16)) {
         problem = "compressed with data fork " + std::to_string(status.st.st_size) + " and header attribute " +
                   std::to_string(header);
-      } else if (!spec.expectCompressed && (static_cast<uint64_t>(status.st.st_size) != spec.size || header != -1 ||
+      } else if (!plan.expectCompressed && (static_cast<uint64_t>(status.st.st_size) != plan.size || header != -1 ||
                                             headerErrno != ENOATTR || fork != -1 || forkErrno != ENOATTR)) {
         problem = "plain with data fork " + std::to_string(status.st.st_size) + ", header attribute " +
                   std::to_string(header) + ", resource fork " + std::to_string(fork);
@@ -435,22 +435,22 @@ int verifyFiles(const std::vector<FileSpec> &specs, const std::string &dir) {
     if (problem.empty()) {
       passed++;
     } else if (reported++ < 10) {
-      ADD_FAILURE() << spec.name << " (" << spec.size << " bytes of "
-                    << (spec.content == Content::kRandom ? "random bytes" : "text") << "): " << problem;
+      ADD_FAILURE() << plan.name << " (" << plan.size << " bytes of "
+                    << (plan.content == Content::kRandom ? "random bytes" : "text") << "): " << problem;
     }
   }
   return passed;
 }
 
-int countItems(const std::vector<FileSpec> &specs) {
+int countItems(const std::vector<FilePlan> &plans) {
   int items = 0;
-  for (const FileSpec &spec : specs) items += itemsFor(spec);
+  for (const FilePlan &plan : plans) items += itemsFor(plan);
   return items;
 }
 
-int countLarge(const std::vector<FileSpec> &specs) {
+int countLarge(const std::vector<FilePlan> &plans) {
   return static_cast<int>(
-      std::count_if(specs.begin(), specs.end(), [](const FileSpec &spec) { return spec.size > kDataPoolMaxCapacity; }));
+      std::count_if(plans.begin(), plans.end(), [](const FilePlan &plan) { return plan.size > kDataPoolMaxCapacity; }));
 }
 
 // ---- Peak memory, measured in a child process ----------------------------------------------
@@ -498,8 +498,8 @@ void runMemoryChild(int reportFd) {
     }
   });
 
-  std::vector<FileSpec> specs = kUnderTsan ? makeWorkload(150, 4, 4) : makeWorkload(1200, 8, 4);
-  RunResult run = runWorkload(specs, dir.path());
+  std::vector<FilePlan> plans = kUnderTsan ? makeWorkload(150, 4, 4) : makeWorkload(1200, 8, 4);
+  RunResult run = runWorkload(plans, dir.path());
   done.store(true);
   sampler.join();
   getrusage(RUSAGE_SELF, &usage);
@@ -508,10 +508,10 @@ void runMemoryChild(int reportFd) {
   EXPECT_EQ(run.finishResult, 0) << strerror(run.finishErrno);
   EXPECT_EQ(throttlingMemoryBudget(), kChildBudget);
   EXPECT_LT(maxCharged.load(), kChildBudget);
-  int verified = verifyFiles(specs, dir.path());
-  EXPECT_EQ(verified, static_cast<int>(specs.size()));
+  int verified = verifyFiles(plans, dir.path());
+  EXPECT_EQ(verified, static_cast<int>(plans.size()));
   dprintf(reportFd, "files %d verified %d startKiB %ld peakKiB %ld maxCharged %llu budget %llu finish %d\n",
-          static_cast<int>(specs.size()), verified, startKiB, peakKiB,
+          static_cast<int>(plans.size()), verified, startKiB, peakKiB,
           static_cast<unsigned long long>(maxCharged.load()), static_cast<unsigned long long>(kChildBudget),
           run.finishResult);
   close(reportFd);
@@ -595,16 +595,16 @@ TEST(PipelineStress, ThousandsOfFilesFromFourThreadsReadBackExactly) {
   const uint64_t chargedBefore = throttlingMemoryCharged();
   const int32_t heldBefore = throttlingDescriptorsHeld();
 
-  std::vector<FileSpec> specs = kUnderTsan ? makeWorkload(400, 3, 3) : makeWorkload(10000, 20, 4);
-  ASSERT_GE(countLarge(specs), kUnderTsan ? 3 : 20);
-  RunResult run = runWorkload(specs, dir.path());
-  printf("%zu files (%d larger than the ring) written in %.1f s, finished %.1f s later\n", specs.size(),
-         countLarge(specs), run.writeSeconds, run.finishSeconds);
+  std::vector<FilePlan> plans = kUnderTsan ? makeWorkload(400, 3, 3) : makeWorkload(10000, 20, 4);
+  ASSERT_GE(countLarge(plans), kUnderTsan ? 3 : 20);
+  RunResult run = runWorkload(plans, dir.path());
+  printf("%zu files (%d larger than the ring) written in %.1f s, finished %.1f s later\n", plans.size(),
+         countLarge(plans), run.writeSeconds, run.finishSeconds);
 
   EXPECT_EQ(run.finishResult, 0) << strerror(run.finishErrno);
   EXPECT_EQ(run.enqueued, run.started);
   EXPECT_EQ(run.started, run.completed);
-  EXPECT_EQ(run.enqueued, countItems(specs));
+  EXPECT_EQ(run.enqueued, countItems(plans));
   EXPECT_EQ(openDescriptorCount(), descriptorsBefore);
   EXPECT_EQ(throttlingMemoryCharged(), chargedBefore);
   EXPECT_EQ(chargedBefore, 0u);
@@ -612,13 +612,13 @@ TEST(PipelineStress, ThousandsOfFilesFromFourThreadsReadBackExactly) {
   EXPECT_EQ(heldBefore, 0);
 
   auto start = std::chrono::steady_clock::now();
-  EXPECT_EQ(verifyFiles(specs, dir.path()), static_cast<int>(specs.size()));
+  EXPECT_EQ(verifyFiles(plans, dir.path()), static_cast<int>(plans.size()));
   printf("read back in %.1f s\n", std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count());
   int compressed = static_cast<int>(
-      std::count_if(specs.begin(), specs.end(), [](const FileSpec &spec) { return spec.expectCompressed; }));
+      std::count_if(plans.begin(), plans.end(), [](const FilePlan &plan) { return plan.expectCompressed; }));
   // The mix covers every outcome.
   EXPECT_GT(compressed, 0);
-  EXPECT_LT(compressed, static_cast<int>(specs.size()));
+  EXPECT_LT(compressed, static_cast<int>(plans.size()));
 }
 
 }  // namespace
