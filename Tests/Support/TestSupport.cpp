@@ -1,6 +1,7 @@
 #include "TestSupport.h"
 
 #include <fcntl.h>
+#include <sys/mman.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
@@ -134,6 +135,33 @@ std::string runCommand(const std::string &command, int *status) {
 }
 
 bool runningAsRoot() { return geteuid() == 0; }
+
+FdCapture::FdCapture(int fd) : fd_(fd) {
+  fflush(nullptr);
+  saved_ = dup(fd);
+  sink_ = memfd_create("capture", 0);
+  dup2(sink_, fd);
+}
+
+FdCapture::~FdCapture() {
+  text();
+  close(sink_);
+}
+
+std::string FdCapture::text() {
+  if (saved_ >= 0) {
+    fflush(nullptr);
+    dup2(saved_, fd_);
+    close(saved_);
+    saved_ = -1;
+  }
+  std::string out;
+  char buffer[65536];
+  ssize_t got;
+  while ((got = pread(sink_, buffer, sizeof buffer, static_cast<off_t>(out.size()))) > 0)
+    out.append(buffer, static_cast<size_t>(got));
+  return out;
+}
 
 TemporaryMount TemporaryMount::ext4WithoutLargeAttributes(const std::string &parentDir) {
   TemporaryMount mount;

@@ -45,6 +45,21 @@ std::string runCommand(const std::string &command, int *status = nullptr);
 
 bool runningAsRoot();
 
+// Sends a descriptor (1 or 2) into an anonymous memory file until text() is called, so that
+// what the library writes to it directly (not through stdio) can be checked.
+class FdCapture {
+ public:
+  explicit FdCapture(int fd);
+  ~FdCapture();
+  FdCapture(const FdCapture &) = delete;
+  FdCapture &operator=(const FdCapture &) = delete;
+  // Restores the descriptor and returns everything written meanwhile.
+  std::string text();
+
+ private:
+  int fd_, saved_ = -1, sink_ = -1;
+};
+
 // A file system mounted on a fresh directory for the life of the object (root only):
 // an ext4 image without large-attribute support, or a tmpfs of the given size.
 class TemporaryMount {

@@ -91,39 +91,6 @@ uint32_t flagsOf(const std::string &path) {
   return st.st_flags;
 }
 
-// Sends a descriptor (1 or 2) into an anonymous memory file until text() is called.
-class FdCapture {
- public:
-  explicit FdCapture(int fd) : fd_(fd) {
-    fflush(nullptr);
-    saved_ = dup(fd);
-    sink_ = memfd_create("capture", 0);
-    dup2(sink_, fd);
-  }
-  ~FdCapture() {
-    text();
-    close(sink_);
-  }
-  // Restores the descriptor and returns everything written meanwhile.
-  std::string text() {
-    if (saved_ >= 0) {
-      fflush(nullptr);
-      dup2(saved_, fd_);
-      close(saved_);
-      saved_ = -1;
-    }
-    std::string out;
-    char buffer[65536];
-    ssize_t got;
-    while ((got = pread(sink_, buffer, sizeof buffer, static_cast<off_t>(out.size()))) > 0)
-      out.append(buffer, static_cast<size_t>(got));
-    return out;
-  }
-
- private:
-  int fd_, saved_ = -1, sink_ = -1;
-};
-
 std::string lastLine(const std::string &text) {
   if (text.empty()) return "";
   size_t end = text.back() == '\n' ? text.size() - 1 : text.size();

@@ -23,38 +23,6 @@ namespace {
 
 const std::string kPrefix = "Libraries/CompressData/FileEnumerator:[0-9]+: ";
 
-// Sends a descriptor (1 or 2) into an anonymous memory file until text() is called.
-class FdCapture {
- public:
-  explicit FdCapture(int fd) : fd_(fd) {
-    fflush(nullptr);
-    saved_ = dup(fd);
-    sink_ = memfd_create("capture", 0);
-    dup2(sink_, fd);
-  }
-  ~FdCapture() {
-    text();
-    close(sink_);
-  }
-  std::string text() {
-    if (saved_ >= 0) {
-      fflush(nullptr);
-      dup2(saved_, fd_);
-      close(saved_);
-      saved_ = -1;
-    }
-    std::string out;
-    char buffer[4096];
-    ssize_t got;
-    while ((got = pread(sink_, buffer, sizeof buffer, static_cast<off_t>(out.size()))) > 0)
-      out.append(buffer, static_cast<size_t>(got));
-    return out;
-  }
-
- private:
-  int fd_, saved_ = -1, sink_ = -1;
-};
-
 // What one enumeration yielded and printed.
 struct Walk {
   std::vector<std::string> paths;
