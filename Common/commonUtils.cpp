@@ -1,8 +1,8 @@
 // The chunking engine: the chunk loop shared by the compression types.
 //
-// zlib is called only from this file, and only from the two small engine classes below
-// (ChunkDeflater, ChunkInflater): another deflate library writing the same zlib-format chunks
-// can replace them without touching the chunk loops.
+// Chunks are encoded and decoded through the process's engine (Common/ChunkEngine.h); the
+// loops here decide sizes, the stored fallback and where every byte goes, the same for every
+// engine.
 #include "Common/commonUtils.h"
 
 #include <zlib.h>
@@ -14,110 +14,13 @@
 #include <cstring>
 #include <memory>
 
+#include "Common/ChunkEngine.h"
 #include "Common/Diagnostics.h"
 #include "Platform/Syscalls.h"
 
 static constexpr char kSourcePath[] = "Common/commonUtils";
 
 namespace {
-
-// The zlib version the chunk streams are set up with; zlib only checks its major number.
-constexpr char kZlibVersion[] = "1.2.5";
-
-// Prints the inflate of a bad chunk byte by byte on standard output, when DUMP_BAD_CHUNKS is
-// set, so that one can see how far the chunk decodes before it goes wrong.
-void dumpBadChunk(z_stream *stream, const uint8_t *data, uint32_t length) {
-  if (!getenv("DUMP_BAD_CHUNKS")) return;
-  inflateReset(stream);
-  stream->next_in = const_cast<Bytef *>(data);
-  stream->avail_in = length;
-  printf("processing chunk of %d bytes\n", static_cast<int>(length));
-  int emitted = 0;
-  while (stream->avail_in > 0) {
-    uint8_t byte = 0;
-    uInt inputBefore = stream->avail_in;
-    stream->next_out = &byte;
-    stream->avail_out = 1;
-    int result = inflate(stream, Z_SYNC_FLUSH);
-    bool gotByte = stream->avail_out == 0;
-    if (gotByte) {
-      emitted++;
-      printf("emitted byte %6d %02x (%c), zret % d, avail_in %6llu (pos %6llu)\n", emitted, byte,
-             byte >= 0x20 && byte <= 0x7E ? byte : '.', result, static_cast<unsigned long long>(stream->avail_in),
-             static_cast<unsigned long long>(length - stream->avail_in));
-    }
-    // A call that neither consumed input nor produced a byte would repeat forever.
-    bool stalled = !gotByte && stream->avail_in == inputBefore;
-    if ((result != Z_OK && result != Z_BUF_ERROR) || stalled) {
-      printf("got % d, avail_in %6llu\n", result, static_cast<unsigned long long>(stream->avail_in));
-      break;
-    }
-  }
-  printf("\n");
-  fflush(stdout);
-}
-
-// One deflate stream for a whole engine call, reset for every chunk.
-class ChunkDeflater {
- public:
-  // A level zlib rejects leaves the stream unusable; the first chunk then fails.
-  explicit ChunkDeflater(int level) { deflateInit_(&stream_, level, kZlibVersion, static_cast<int>(sizeof stream_)); }
-  ~ChunkDeflater() { deflateEnd(&stream_); }
-  ChunkDeflater(const ChunkDeflater &) = delete;
-  ChunkDeflater &operator=(const ChunkDeflater &) = delete;
-
-  // Compresses count bytes into one complete zlib stream in a single call with room for space
-  // bytes. Returns zlib's result (Z_STREAM_END when the stream fit); *produced gets the bytes
-  // written.
-  int deflateChunk(const uint8_t *input, uint32_t count, uint8_t *output, uint32_t space, uint32_t *produced) {
-    deflateReset(&stream_);
-    stream_.next_in = const_cast<Bytef *>(input);
-    stream_.avail_in = count;
-    stream_.next_out = output;
-    stream_.avail_out = space;
-    int result = deflate(&stream_, Z_FINISH);
-    *produced = space - stream_.avail_out;
-    return result;
-  }
-
- private:
-  z_stream stream_{};
-};
-
-// One inflate stream for a whole engine call; begin() starts each chunk.
-class ChunkInflater {
- public:
-  ChunkInflater() { inflateInit_(&stream_, kZlibVersion, static_cast<int>(sizeof stream_)); }
-  ~ChunkInflater() { inflateEnd(&stream_); }
-  ChunkInflater(const ChunkInflater &) = delete;
-  ChunkInflater &operator=(const ChunkInflater &) = delete;
-
-  void begin(const uint8_t *chunk, uint32_t length) {
-    inflateReset(&stream_);
-    stream_.next_in = const_cast<Bytef *>(chunk);
-    stream_.avail_in = length;
-    ended_ = false;
-  }
-  // Inflates the chunk's next bytes into space bytes at output, with Z_FINISH. Returns false
-  // when inflate failed (*result holds zlib's result); *produced gets the bytes written.
-  bool inflateInto(uint8_t *output, uint32_t space, uint32_t *produced, int *result) {
-    stream_.next_out = output;
-    stream_.avail_out = space;
-    *result = inflate(&stream_, Z_FINISH);
-    *produced = space - stream_.avail_out;
-    if (*result == Z_STREAM_END) ended_ = true;
-    // Running out of room is expected; stopping with room left, or any zlib error (a bad
-    // checksum is found even when the output has just filled), means the chunk is bad.
-    if (*result == Z_STREAM_END) return true;
-    return (*result == Z_OK || *result == Z_BUF_ERROR) && stream_.avail_out == 0;
-  }
-  bool chunkDone() const { return ended_ || stream_.avail_in == 0; }
-  void dump(const uint8_t *chunk, uint32_t length) { dumpBadChunk(&stream_, chunk, length); }
-
- private:
-  z_stream stream_{};
-  bool ended_ = false;
-};
 
 bool isPowerOfTwo(uint32_t value) { return value != 0 && (value & (value - 1)) == 0; }
 
@@ -220,7 +123,7 @@ int chunkingCompressor(FileHandle *handle, int32_t maxChunks, uint32_t chunkSize
   // The chunk is read behind one free byte, where the stored-chunk marker goes.
   uint8_t *data = input.get() + prefixBytes + 1;
 
-  ChunkDeflater deflater(level);
+  std::unique_ptr<ChunkEncoder> encoder = ChunkEncoder::create(currentChunkEngine(), level);
   int result = 0;
   bool failed = false;
   ConsumedInput consumed = {0, 0, 0, data};
@@ -241,13 +144,14 @@ int chunkingCompressor(FileHandle *handle, int32_t maxChunks, uint32_t chunkSize
     uint32_t n = static_cast<uint32_t>(count);
     uint32_t space = std::min(n, outputLimit);
     uint32_t produced = 0;
-    int deflated = deflater.deflateChunk(data, n, output.get() + prefixBytes, space, &produced);
+    int deflated = Z_OK;
+    ChunkEncoder::Result encoded = encoder->encode(data, n, output.get() + prefixBytes, space, &produced, &deflated);
     uint8_t *chunk;
     uint32_t length;
-    if (deflated == Z_STREAM_END) {
+    if (encoded == ChunkEncoder::Result::Fit) {
       chunk = output.get();
       length = produced;
-    } else if (produced < space) {
+    } else if (encoded == ChunkEncoder::Result::Failed) {
       PLZC_ERR("%s:%d: Error: failed to deflate in one pass: %d\n", deflated);
       result = -1;
       failed = true;
@@ -308,7 +212,7 @@ int64_t chunkingDecompressor(int64_t offset, uint64_t size, uint32_t vectorCount
     return -1;
   }
 
-  ChunkInflater inflater;
+  std::unique_ptr<ChunkDecoder> decoder = ChunkDecoder::create(currentChunkEngine(), chunkSize);
   uint32_t vector = 0;
   uint64_t position = 0;
   uint64_t remaining = size;
@@ -328,10 +232,10 @@ int64_t chunkingDecompressor(int64_t offset, uint64_t size, uint32_t vectorCount
         written = copyIntoVectors(chunk + 1 + skip, std::min<uint64_t>(remaining, static_cast<uint64_t>(usable)),
                                   vectorCount, vectors, &vector, &position);
     } else {
-      inflater.begin(chunk, n);
+      decoder->begin(chunk, n);
       int inflated = Z_OK;
       uint32_t produced = 0;
-      bool ok = skip == 0 || inflater.inflateInto(scratch.get(), skip, &produced, &inflated);
+      bool ok = skip == 0 || decoder->decodeInto(scratch.get(), skip, &produced, &inflated);
       while (ok && vector < vectorCount) {
         if (position > vectors[vector].iov_len) {
           PLZC_ERR("%s:%d: Error: overwrote end of vector\n");
@@ -342,19 +246,19 @@ int64_t chunkingDecompressor(int64_t offset, uint64_t size, uint32_t vectorCount
         uint64_t space = vectors[vector].iov_len - position;
         produced = 0;
         if (space > 0)
-          ok = inflater.inflateInto(static_cast<uint8_t *>(vectors[vector].iov_base) + position,
+          ok = decoder->decodeInto(static_cast<uint8_t *>(vectors[vector].iov_base) + position,
                                     static_cast<uint32_t>(space), &produced, &inflated);
         written += produced;
         position += produced;
         if (!ok) break;
-        if (inflater.chunkDone()) break;  // the next chunk continues in this vector
+        if (decoder->chunkDone()) break;  // the next chunk continues in this vector
         vector++;                         // this vector is full
         position = 0;
       }
       if (!ok) {
         printf("failed to inflate in one pass: %d\n", inflated);
         fflush(stdout);
-        inflater.dump(chunk, n);
+        decoder->dump(chunk, n);
         PLZC_ERR("%s:%d: decompressChunk %llu: %s\n", static_cast<unsigned long long>(chunkIndex), strerror(errno));
         return -1;
       }

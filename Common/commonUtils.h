@@ -1,7 +1,7 @@
 // The chunking engine shared by the compression types.
 //
 // A file is stored as independently compressed chunks of `chunkSize` uncompressed bytes. Each
-// chunk is one zlib stream made by a single deflate call, or, when deflate cannot make it
+// chunk is one zlib-format stream made in a single call of the engine, or, when it cannot make it
 // smaller, the marker byte 0xFF followed by the raw bytes (a zlib stream never starts with
 // 0xFF). The engine knows nothing about where chunks are stored: a type hands it two callbacks.
 #pragma once

@@ -7,6 +7,7 @@ packages=(
   build-essential cmake ninja-build pkg-config   # toolchain
   libgtest-dev libgmock-dev libbenchmark-dev     # tests and benchmarks
   zlib1g-dev libmd-dev libplist-dev              # chunk codec, digests, property lists
+  libdeflate-dev libisal-dev                     # the faster chunk engines
   attr e2fsprogs util-linux mount                # getfattr, mkfs.ext4, loop mounts in tests
 )
 

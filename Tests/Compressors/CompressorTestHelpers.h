@@ -17,6 +17,7 @@
 
 #include <gtest/gtest.h>
 
+#include "Common/ChunkEngine.h"
 #include "Common/FileHandle.h"
 #include "Platform/Syscalls.h"
 #include "Support/TestSupport.h"
@@ -41,22 +42,47 @@ inline Bytes randomThenZeros(size_t randomCount, size_t count, uint32_t seed) {
   return out;
 }
 
-// Length of the zlib stream the engine makes of these bytes at this level (one deflate call with
-// zlib's defaults), measured with zlib itself.
+// Length of the zlib-format stream the process's engine makes of these bytes at this level,
+// given all the room it wants.
 inline size_t zlibStreamLength(const Bytes &data, int level) {
-  uLongf length = compressBound(data.size());
-  Bytes out(length);
-  EXPECT_EQ(compress2(out.data(), &length, data.data(), data.size(), level), Z_OK);
+  std::unique_ptr<ChunkEncoder> encoder = ChunkEncoder::create(currentChunkEngine(), level);
+  Bytes out(compressBound(data.size()) + 64);
+  uint32_t length = 0;
+  int code = 0;
+  EXPECT_EQ(encoder->encode(data.data(), static_cast<uint32_t>(data.size()), out.data(),
+                            static_cast<uint32_t>(out.size()), &length, &code),
+            ChunkEncoder::Result::Fit);
   return length;
 }
 
 // Finds `randomCount` such that randomThenZeros(randomCount, count) has a stream of exactly
-// `streamLength` bytes, searching upward from `from`; nullopt when no count in range hits it.
-inline std::optional<Bytes> dataWithStreamLength(size_t streamLength, size_t count, int level, size_t from,
-                                                 size_t to) {
-  for (size_t n = from; n <= to; n++) {
-    Bytes data = randomThenZeros(n, count, 99);
-    if (zlibStreamLength(data, level) == streamLength) return data;
+// `streamLength` bytes; nullopt when none does. The length grows with the random count, about
+// one byte per byte but with jumps where an engine changes its blocks, so the search bisects to
+// the right neighbourhood and tries the counts around it. Where every count jumps over the
+// length, bytes of a four-letter alphabet (about a quarter of a byte each) fill the gap.
+inline std::optional<Bytes> dataWithStreamLength(size_t streamLength, size_t count, int level) {
+  auto make = [count](size_t randomCount, size_t fourLetterCount, uint32_t seed) {
+    Bytes data = randomThenZeros(randomCount, count, seed);
+    Bytes letters = randomBytes(fourLetterCount, seed + 1000);
+    for (size_t i = 0; i < fourLetterCount && randomCount + i < count; i++) data[randomCount + i] = letters[i] & 3;
+    return data;
+  };
+  for (size_t fourLetters = 0; fourLetters <= 1024; fourLetters += 8) {
+    for (uint32_t seed = 99; seed < (fourLetters == 0 ? 107u : 100u); seed++) {
+      size_t low = 0, high = count - fourLetters;
+      while (low < high) {
+        size_t middle = (low + high) / 2;
+        if (zlibStreamLength(make(middle, fourLetters, seed), level) < streamLength) {
+          low = middle + 1;
+        } else {
+          high = middle;
+        }
+      }
+      for (size_t n = low > 256 ? low - 256 : 0; n <= std::min(count - fourLetters, low + 64); n++) {
+        Bytes data = make(n, fourLetters, seed);
+        if (zlibStreamLength(data, level) == streamLength) return data;
+      }
+    }
   }
   return std::nullopt;
 }

@@ -110,7 +110,7 @@ class Type3StreamLengths : public Type3, public ::testing::WithParamInterface<si
 
 TEST_P(Type3StreamLengths, OnlyStreamsThatFitBehindTheHeaderAreTaken) {
   size_t streamLength = GetParam();
-  std::optional<Bytes> data = dataWithStreamLength(streamLength, 8000, kLevel, 3600, 3900);
+  std::optional<Bytes> data = dataWithStreamLength(streamLength, 8000, kLevel);
   ASSERT_TRUE(data.has_value()) << "no test data with that stream length";
   FileHandle *fh = open(*data);
   EXPECT_EQ(compress(fh), streamLength <= 3786 ? 0 : -1);

@@ -180,7 +180,7 @@ INSTANTIATE_TEST_SUITE_P(Files, Type4SingleChunk,
 class Type4Budget : public Type4, public ::testing::WithParamInterface<size_t> {};
 
 TEST_P(Type4Budget, TenBlockFileGetsEightBlocks) {
-  std::optional<Bytes> data = dataWithStreamLength(GetParam(), 40960, kLevel, 32200, 32600);
+  std::optional<Bytes> data = dataWithStreamLength(GetParam(), 40960, kLevel);
   ASSERT_TRUE(data.has_value()) << "no test data with that stream length";
   FileHandle *fh = open(*data);
   fh->blockSize = fixedBlockSize<4096>;

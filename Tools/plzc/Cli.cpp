@@ -10,6 +10,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "Common/ChunkEngine.h"
 #include "Console.h"
 
 namespace plzc {
@@ -60,6 +61,26 @@ bool parseNumber(const char *text, long min, long max, long *out) {
   if (errno != 0 || *end != '\0' || value < min || value > max) return false;
   *out = value;
   return true;
+}
+
+const char kEngineHelp[] =
+    "      --engine=NAME  deflate engine: libdeflate (the default), zlib (the reference) or\n"
+    "                     isal (fastest, larger output); every engine reads what any other wrote\n";
+const char kFastHelp[] =
+    "      --fast         speed over size: the isal engine at level 1 (same as --engine=isal -l 1)\n";
+
+int chooseEngine(const char *command, const char *name) {
+  ChunkEngine engine;
+  if (!chunkEngineFromName(name, &engine))
+    return usageError(command, std::string("unknown engine '") + name + "': give zlib, libdeflate or isal");
+  if (!setChunkEngine(engine))
+    return usageError(command, std::string("engine '") + name + "' is not built into this plzc");
+  return kExitSuccess;
+}
+
+int chooseFastEngine(const char *command, long *level) {
+  *level = 1;
+  return chooseEngine(command, chunkEngineName(ChunkEngine::Isal));
 }
 
 std::vector<std::string> operands(int argc, char **argv) {

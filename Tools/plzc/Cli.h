@@ -40,6 +40,16 @@ int usageError(const char *command, const std::string &message);
 // Parses a whole decimal number in [min, max]; false when text is anything else.
 bool parseNumber(const char *text, long min, long max, long *out);
 
+// --engine NAME: makes NAME ("zlib", "libdeflate", "isal") the chunk engine of this run.
+// Returns kExitSuccess, or kExitUsage after saying what was wrong (not an engine, or not built
+// into this plzc).
+int chooseEngine(const char *command, const char *name);
+// --fast: the fast engine at its fastest level (level 1), speed over size.
+int chooseFastEngine(const char *command, long *level);
+// The help lines of --engine and --fast, aligned at column 21 of the option list.
+extern const char kEngineHelp[];
+extern const char kFastHelp[];
+
 // The arguments left after the options.
 std::vector<std::string> operands(int argc, char **argv);
 

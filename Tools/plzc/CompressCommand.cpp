@@ -11,14 +11,15 @@ namespace plzc {
 
 namespace {
 
-enum LongOnly { kVerify = 256, kToc, kLargeForks, kNoProgress, kAsync };
+enum LongOnly { kVerify = 256, kToc, kLargeForks, kNoProgress, kAsync, kEngine, kFast };
 
 const option kOptions[] = {
     {"types", required_argument, nullptr, 't'},   {"level", required_argument, nullptr, 'l'},
     {"verify", no_argument, nullptr, kVerify},    {"toc", required_argument, nullptr, kToc},
     {"large-forks", no_argument, nullptr, kLargeForks}, {"jobs", required_argument, nullptr, 'j'},
     {"verbose", no_argument, nullptr, 'v'},       {"no-progress", no_argument, nullptr, kNoProgress},
-    {"async", no_argument, nullptr, kAsync},      {"help", no_argument, nullptr, 'h'},
+    {"async", no_argument, nullptr, kAsync},      {"engine", required_argument, nullptr, kEngine},
+    {"fast", no_argument, nullptr, kFast},        {"help", no_argument, nullptr, 'h'},
     {nullptr, 0, nullptr, 0},
 };
 
@@ -32,7 +33,9 @@ void printHelp() {
       "  -t, --types=LIST   compression types to try, in this order (default 3,4): type 3 keeps a\n"
       "                     small file inside its header attribute, type 4 keeps 64 KiB chunks in\n"
       "                     the resource fork\n"
-      "  -l, --level=LEVEL  zlib level, 1 (fastest) to 9 (smallest) (default 5)\n"
+      "  -l, --level=LEVEL  level, 1 (fastest) to 9 (smallest) (default 5)\n"
+      "%s"
+      "%s"
       "      --verify       read each compressed file back and compare it with the original\n"
       "      --toc=FILE     leave the files unchanged and write their compressed attributes to\n"
       "                     FILE, a table of contents (see 'plzc toc list')\n"
@@ -51,7 +54,7 @@ void printHelp() {
       "Exit status: 0 when every file was compressed or left as it was for a reason of its own\n"
       "(did not shrink, empty, already compressed), 1 when a file or a PATH failed, 2 on a usage\n"
       "error, 130 when interrupted.\n",
-      availableProcessors());
+      kEngineHelp, kFastHelp, availableProcessors());
 }
 
 }  // namespace
@@ -87,6 +90,13 @@ int compressCommand(int argc, char **argv) {
         break;
       case kLargeForks: options.largeForks = true; break;
       case kAsync: options.async = true; break;
+      case kEngine:
+        if (int status = chooseEngine(command, optarg); status != kExitSuccess) return status;
+        break;
+      case kFast:
+        if (int status = chooseFastEngine(command, &number); status != kExitSuccess) return status;
+        options.level = static_cast<int>(number);
+        break;
       case kNoProgress: progress = false; break;
       case 'v': verbose = true; break;
       case 'h': printHelp(); return kExitSuccess;

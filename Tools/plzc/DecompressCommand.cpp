@@ -22,13 +22,13 @@ namespace plzc {
 
 namespace {
 
-enum LongOnly { kVerify = 256, kUserSpace, kNoProgress };
+enum LongOnly { kVerify = 256, kUserSpace, kNoProgress, kEngine };
 
 const option kDecompressOptions[] = {
     {"verify", no_argument, nullptr, kVerify}, {"user-space", no_argument, nullptr, kUserSpace},
     {"jobs", required_argument, nullptr, 'j'}, {"verbose", no_argument, nullptr, 'v'},
-    {"no-progress", no_argument, nullptr, kNoProgress}, {"help", no_argument, nullptr, 'h'},
-    {nullptr, 0, nullptr, 0},
+    {"no-progress", no_argument, nullptr, kNoProgress}, {"engine", required_argument, nullptr, kEngine},
+    {"help", no_argument, nullptr, 'h'},               {nullptr, 0, nullptr, 0},
 };
 
 void printDecompressHelp() {
@@ -40,6 +40,7 @@ void printDecompressHelp() {
       "      --verify       checksum each file's data before and compare it afterwards\n"
       "      --user-space   decompress in the library even where the kernel could (on Linux the\n"
       "                     library always does)\n"
+      "%s"
       "  -j, --jobs=N       worker threads (default: one per processor, here %d)\n"
       "  -v, --verbose      report every file on standard error and close with a summary\n"
       "      --no-progress  never draw the progress line (drawn only on a terminal)\n"
@@ -47,7 +48,7 @@ void printDecompressHelp() {
       "\n"
       "Exit status: 0 when every compressed file was decompressed, 1 when a file or a PATH failed,\n"
       "2 on a usage error, 130 when interrupted.\n",
-      availableProcessors());
+      kEngineHelp, availableProcessors());
 }
 
 struct DecompressTotals {
@@ -102,6 +103,9 @@ int decompressCommand(int argc, char **argv) {
     switch (c) {
       case kVerify: verify = true; break;
       case kUserSpace: userSpace = true; break;
+      case kEngine:
+        if (int status = chooseEngine(command, optarg); status != kExitSuccess) return status;
+        break;
       case kNoProgress: progressWanted = false; break;
       case 'j':
         if (!parseNumber(optarg, 1, 1024, &number))
@@ -147,17 +151,24 @@ int decompressCommand(int argc, char **argv) {
 
 int catCommand(int argc, char **argv) {
   const char *command = "cat";
-  static const option kCatOptions[] = {{"help", no_argument, nullptr, 'h'}, {nullptr, 0, nullptr, 0}};
+  static const option kCatOptions[] = {
+      {"engine", required_argument, nullptr, kEngine}, {"help", no_argument, nullptr, 'h'}, {nullptr, 0, nullptr, 0}};
   for (int c; (c = nextOption(command, argc, argv, "h", kCatOptions)) != -1;) {
+    if (c == kEngine) {
+      if (int status = chooseEngine(command, optarg); status != kExitSuccess) return status;
+      continue;
+    }
     if (c != 'h') return kExitUsage;
     printf(
-        "Usage: plzc cat PATH...\n"
+        "Usage: plzc cat [--engine=NAME] PATH...\n"
         "Write the data of each file to standard output, decompressing compressed files, in the\n"
         "order given.\n"
         "\n"
-        "  -h, --help  show this help and exit\n"
+        "%s"
+        "  -h, --help         show this help and exit\n"
         "\n"
-        "Exit status: 0 when every file was written whole, 1 otherwise, 2 on a usage error.\n");
+        "Exit status: 0 when every file was written whole, 1 otherwise, 2 on a usage error.\n",
+        kEngineHelp);
     return kExitSuccess;
   }
   std::vector<std::string> paths = operands(argc, argv);

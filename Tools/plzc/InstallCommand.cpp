@@ -1,6 +1,7 @@
 // plzc install: copies files and trees to a destination as new files, compressed on the way by
 // the stream pipeline.
 #include <cstdio>
+#include <cstring>
 #include <string>
 
 #include "Cli.h"
@@ -14,7 +15,8 @@ namespace plzc {
 
 namespace {
 
-enum LongOnly { kOptionsFile = 256, kRules, kSkipMachO, kIgnoreXattrErrors, kThrottled, kLargeForks, kNoProgress };
+enum LongOnly { kOptionsFile = 256, kRules, kSkipMachO, kIgnoreXattrErrors, kThrottled, kLargeForks, kNoProgress,
+               kEngine, kFast };
 
 const option kOptions[] = {
     {"options", required_argument, nullptr, kOptionsFile},
@@ -28,9 +30,23 @@ const option kOptions[] = {
     {"jobs", required_argument, nullptr, 'j'},
     {"verbose", no_argument, nullptr, 'v'},
     {"no-progress", no_argument, nullptr, kNoProgress},
+    {"engine", required_argument, nullptr, kEngine},
+    {"fast", no_argument, nullptr, kFast},
     {"help", no_argument, nullptr, 'h'},
     {nullptr, 0, nullptr, 0},
 };
+
+// The shared help lines, moved to this list's wider column.
+std::string indentedEngineHelp(const char *lines) {
+  std::string out;
+  for (const char *line = lines; *line;) {
+    const char *end = strchr(line, '\n');
+    std::string text(line, end - line);
+    out += text.substr(0, 21) + "      " + text.substr(21) + "\n";
+    line = end + 1;
+  }
+  return out;
+}
 
 void printHelp() {
   printf(
@@ -45,7 +61,9 @@ void printHelp() {
       "                           override its keys\n"
       "  -t, --types=LIST         compression types to try, in this order: 3, 4, 3,4 or 4,3\n"
       "                           (default: the library's, type 4)\n"
-      "  -l, --level=LEVEL        zlib level, 1 (fastest) to 9 (smallest)\n"
+      "  -l, --level=LEVEL        level, 1 (fastest) to 9 (smallest)\n"
+      "%s"
+      "%s"
       "      --rules=FILE         an XML property list holding an array of rule dictionaries,\n"
       "                           applied before the system rules\n"
       "      --skip-macho=TYPES   leave Mach-O files of these types uncompressed: names such as\n"
@@ -68,7 +86,7 @@ void printHelp() {
       "Exit status: 0 when everything was copied, 1 when a file failed or the pipeline's finish\n"
       "failed (the files named in its messages are listed), 2 on a usage error or an unusable\n"
       "--options or --rules file, 130 when interrupted.\n",
-      availableProcessors());
+      indentedEngineHelp(kEngineHelp).c_str(), indentedEngineHelp(kFastHelp).c_str(), availableProcessors());
 }
 
 }  // namespace
@@ -111,6 +129,13 @@ int installCommand(int argc, char **argv) {
         if (!parseNumber(optarg, 1, 1024, &number))
           return usageError(command, std::string("invalid number of jobs '") + optarg + "': give 1 to 1024");
         jobs = static_cast<int>(number);
+        break;
+      case kEngine:
+        if (int status = chooseEngine(command, optarg); status != kExitSuccess) return status;
+        break;
+      case kFast:
+        if (int status = chooseFastEngine(command, &number); status != kExitSuccess) return status;
+        choices.level = number;
         break;
       case kNoProgress: progress = false; break;
       case 'v': verbose = true; break;

@@ -1,0 +1,106 @@
+// The ISA-L igzip engine: the fastest, for users who want speed over size.
+#include <isa-l/igzip_lib.h>
+#include <zlib.h>
+
+#include <memory>
+
+#include "Common/ChunkEngine.h"
+
+namespace {
+
+// The library's levels 1 to 9 (and -1, zlib's default) in igzip's levels 1 to 3.
+int isalLevel(int level) {
+  static constexpr int kLevels[10] = {1, 1, 1, 2, 2, 2, 3, 3, 3, 3};
+  if (level == -1) return kLevels[6];
+  return level >= 0 && level <= 9 ? kLevels[level] : -1;
+}
+
+uint32_t levelBufferSize(int isalLevel) {
+  static constexpr uint32_t kSizes[4] = {ISAL_DEF_LVL0_DEFAULT, ISAL_DEF_LVL1_DEFAULT, ISAL_DEF_LVL2_DEFAULT,
+                                         ISAL_DEF_LVL3_DEFAULT};
+  return kSizes[isalLevel];
+}
+
+class IsalChunkEncoder final : public ChunkEncoder {
+ public:
+  explicit IsalChunkEncoder(int level) : level_(isalLevel(level)), storeOnly_(level == 0) {
+    if (level_ < 0) return;
+    levelBufferSize_ = levelBufferSize(level_);
+    levelBuffer_.reset(new (std::nothrow) uint8_t[levelBufferSize_ ? levelBufferSize_ : 1]);
+  }
+
+  Result encode(const uint8_t *input, uint32_t count, uint8_t *output, uint32_t space, uint32_t *produced,
+                int *code) override {
+    *produced = 0;
+    if (level_ < 0 || !levelBuffer_) {
+      *code = level_ < 0 ? Z_STREAM_ERROR : Z_MEM_ERROR;
+      return Result::Failed;
+    }
+    // Level 0 means no compression, as in zlib, whose level-0 stream is always larger than
+    // its input: the chunk is stored. igzip's level 0 still compresses.
+    if (storeOnly_) {
+      *code = Z_OK;
+      return Result::NoFit;
+    }
+    isal_zstream stream;
+    isal_deflate_stateless_init(&stream);
+    stream.level = static_cast<uint32_t>(level_);
+    stream.level_buf = levelBuffer_.get();
+    stream.level_buf_size = levelBufferSize_;
+    stream.gzip_flag = IGZIP_ZLIB;
+    stream.end_of_stream = 1;
+    stream.flush = NO_FLUSH;
+    stream.next_in = const_cast<uint8_t *>(input);
+    stream.avail_in = count;
+    stream.next_out = output;
+    stream.avail_out = space;
+    int result = isal_deflate_stateless(&stream);
+    if (result == COMP_OK) {
+      *produced = stream.total_out;
+      *code = Z_STREAM_END;
+      return Result::Fit;
+    }
+    if (result == STATELESS_OVERFLOW) {
+      *code = Z_OK;
+      return Result::NoFit;
+    }
+    *code = Z_STREAM_ERROR;
+    return Result::Failed;
+  }
+
+ private:
+  int level_;
+  bool storeOnly_;
+  uint32_t levelBufferSize_ = 0;
+  std::unique_ptr<uint8_t[]> levelBuffer_;
+};
+
+class IsalChunkDecoder final : public WholeChunkDecoder {
+ public:
+  explicit IsalChunkDecoder(uint32_t chunkSize) : WholeChunkDecoder(chunkSize), state_(new inflate_state) {}
+
+ protected:
+  bool decodeWhole(const uint8_t *chunk, uint32_t length, uint8_t *output, uint32_t capacity,
+                   uint32_t *decoded) override {
+    isal_inflate_init(state_.get());
+    state_->crc_flag = ISAL_ZLIB;
+    state_->next_in = const_cast<uint8_t *>(chunk);
+    state_->avail_in = length;
+    state_->next_out = output;
+    state_->avail_out = capacity;
+    if (isal_inflate_stateless(state_.get()) != ISAL_DECOMP_OK) return false;
+    *decoded = state_->total_out;
+    return true;
+  }
+
+ private:
+  std::unique_ptr<inflate_state> state_;
+};
+
+}  // namespace
+
+std::unique_ptr<ChunkEncoder> makeIsalChunkEncoder(int level) { return std::make_unique<IsalChunkEncoder>(level); }
+
+std::unique_ptr<ChunkDecoder> makeIsalChunkDecoder(uint32_t chunkSize) {
+  return std::make_unique<IsalChunkDecoder>(chunkSize);
+}
