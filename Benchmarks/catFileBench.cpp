@@ -8,8 +8,9 @@
 //   - the baseline: the fork's chunk table read into memory once, then every chunk inflated
 //     into one 64 KiB buffer with zlib, on one thread.
 // Both outputs are checked against the original data once, outside the timed runs. Prints both
-// throughputs in MB/s (10^6 bytes of logical data per second) and their ratio; the target is
-// a ratio of at least 0.8.
+// throughputs in MB/s (10^6 bytes of logical data per second) and their ratio, for the engine
+// in use (PLZC_ENGINE, default libdeflate); the target is a ratio of at least 0.8 with zlib and
+// 2.0 with the faster engines.
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -25,6 +26,7 @@
 #include <thread>
 #include <vector>
 
+#include "Common/ChunkEngine.h"
 #include "Libraries/CompressData/DiskHeader.h"
 #include "Platform/ExtendedAttributes.h"
 #include "Plenzo.h"
@@ -33,7 +35,7 @@ namespace {
 
 constexpr uint32_t kChunkSize = 65536;
 constexpr uint32_t kChunkCountPosition = 260;  // fork offset of the chunk count; table offsets count from here
-constexpr double kTargetRatio = 0.8;
+double targetRatio() { return currentChunkEngine() == ChunkEngine::Zlib ? 0.8 : 2.0; }
 
 double secondsSince(std::chrono::steady_clock::time_point start) {
   return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
@@ -251,7 +253,8 @@ int main(int argc, char **argv) {
   printf("  baseline   %8.1f MB/s  zlib inflate of the chunks in memory, one thread (best of %d)\n", baselineRate,
          repetitions);
   printf("  catFile    %8.1f MB/s  to /dev/null (best of %d)\n", catRate, repetitions);
-  printf("  ratio      %.2f (target %.1f: %s)\n", ratio, kTargetRatio, ratio >= kTargetRatio ? "met" : "NOT met");
+  printf("  ratio      %.2f (engine %s, target %.1f: %s)\n", ratio, chunkEngineName(currentChunkEngine()),
+         targetRatio(), ratio >= targetRatio() ? "met" : "NOT met");
 
   unlink(path.c_str());
   rmdir(dirName.data());

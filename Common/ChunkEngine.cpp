@@ -210,6 +210,39 @@ bool WholeChunkDecoder::chunkDone() const { return useZlib_ ? zlib_->chunkDone()
 
 void WholeChunkDecoder::dump(const uint8_t *chunk, uint32_t length) { zlib_->dump(chunk, length); }
 
+namespace {
+
+// The thread's kept decoder: one at a time, for the engine and chunk size last asked for.
+struct KeptDecoder {
+  std::unique_ptr<ChunkDecoder> decoder;
+  ChunkEngine engine = ChunkEngine::Zlib;
+  uint32_t chunkSize = 0;
+  bool leased = false;
+};
+thread_local KeptDecoder tKeptDecoder;
+
+}  // namespace
+
+ChunkDecoderLease::ChunkDecoderLease(ChunkEngine engine, uint32_t chunkSize) {
+  KeptDecoder &kept = tKeptDecoder;
+  if (kept.leased) {
+    own_ = ChunkDecoder::create(engine, chunkSize);
+    decoder_ = own_.get();
+    return;
+  }
+  if (!kept.decoder || kept.engine != engine || kept.chunkSize != chunkSize) {
+    kept.decoder = ChunkDecoder::create(engine, chunkSize);
+    kept.engine = engine;
+    kept.chunkSize = chunkSize;
+  }
+  kept.leased = leased_ = true;
+  decoder_ = kept.decoder.get();
+}
+
+ChunkDecoderLease::~ChunkDecoderLease() {
+  if (leased_) tKeptDecoder.leased = false;
+}
+
 std::unique_ptr<ChunkEncoder> makeZlibChunkEncoder(int level) { return std::make_unique<ZlibChunkEncoder>(level); }
 std::unique_ptr<ChunkDecoder> makeZlibChunkDecoder() { return std::make_unique<ZlibChunkDecoder>(); }
 

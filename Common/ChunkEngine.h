@@ -44,6 +44,26 @@ class ChunkEncoder {
                         int *code) = 0;
 };
 
+class ChunkDecoder;
+
+// A decoder of the engine kept by the calling thread for its later reads, so that reading a
+// file in many small pieces does not build and free a decoder (and its buffers) for every
+// piece. Released when the lease ends; a thread that leases again while holding a lease (a
+// nested read) gets a decoder of its own for that lease.
+class ChunkDecoderLease {
+ public:
+  ChunkDecoderLease(ChunkEngine engine, uint32_t chunkSize);
+  ~ChunkDecoderLease();
+  ChunkDecoderLease(const ChunkDecoderLease &) = delete;
+  ChunkDecoderLease &operator=(const ChunkDecoderLease &) = delete;
+  ChunkDecoder *operator->() const { return decoder_; }
+
+ private:
+  ChunkDecoder *decoder_;
+  std::unique_ptr<ChunkDecoder> own_;  // the nested case
+  bool leased_ = false;
+};
+
 // Decodes one chunk at a time, in pieces: begin() starts a chunk, decodeInto() fills the next
 // bytes. Engines that cannot stop part-way decode the chunk whole into a buffer of their own
 // and copy out; a chunk they cannot decode whole is handed to zlib, so a damaged chunk has

@@ -212,7 +212,7 @@ int64_t chunkingDecompressor(int64_t offset, uint64_t size, uint32_t vectorCount
     return -1;
   }
 
-  std::unique_ptr<ChunkDecoder> decoder = ChunkDecoder::create(currentChunkEngine(), chunkSize);
+  ChunkDecoderLease decoder(currentChunkEngine(), chunkSize);
   uint32_t vector = 0;
   uint64_t position = 0;
   uint64_t remaining = size;

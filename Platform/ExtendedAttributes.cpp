@@ -6,6 +6,7 @@
 #include <sys/xattr.h>
 
 #include <algorithm>
+#include <atomic>
 #include <bit>
 #include <cstring>
 #include <memory>
@@ -56,6 +57,10 @@ uint8_t *scratch() {
   return buffer.get();
 }
 
+// Bumped by every attribute write and removal of the process; cached segments read before the
+// last bump are stale.
+std::atomic<uint64_t> gWriteEpoch{0};
+
 // Where the Linux calls go: a path (following links or not) or a descriptor.
 class Target {
  public:
@@ -68,11 +73,13 @@ class Target {
                      : sys::getxattr(path_, name.c_str(), value, size);
   }
   int set(const std::string &name, const void *value, size_t size) const {
+    gWriteEpoch.fetch_add(1, std::memory_order_relaxed);
     if (!path_) return sys::fsetxattr(fd_, name.c_str(), value, size, 0);
     return noFollow_ ? sys::lsetxattr(path_, name.c_str(), value, size, 0)
                      : sys::setxattr(path_, name.c_str(), value, size, 0);
   }
   int remove(const std::string &name) const {
+    gWriteEpoch.fetch_add(1, std::memory_order_relaxed);
     if (!path_) return sys::fremovexattr(fd_, name.c_str());
     return noFollow_ ? sys::lremovexattr(path_, name.c_str()) : sys::removexattr(path_, name.c_str());
   }
@@ -87,6 +94,9 @@ class Target {
     if (result == 0) *type = static_cast<long>(st.f_type);
     return result;
   }
+
+  // Names the file for the read cache: its path, or its descriptor.
+  std::string identity() const { return path_ ? std::string(noFollow_ ? "l:" : "p:") + path_ : "f:" + std::to_string(fd_); }
 
   // Every Linux attribute name of the file, or false with errno.
   bool allNames(std::vector<std::string> *names) const {
@@ -302,6 +312,68 @@ bool readPlain(const Target &target, const Names &names, std::vector<uint8_t> *v
   }
 }
 
+// The state behind an XattrReadCache: the last two segments read, and the value last found
+// segmented (its plain form need not be tried first).
+struct ReadCacheState {
+  struct Slot {
+    std::string key;
+    std::unique_ptr<uint8_t[]> bytes;
+    ssize_t length = 0;
+    uint64_t epoch = 0;
+  };
+  Slot slots[2];
+  int next = 0;
+  std::string segmentedValue;
+  uint64_t segmentedEpoch = 0;
+};
+thread_local ReadCacheState *tReadCache = nullptr;
+
+// Reads one segment for a partial copy: from the thread's read cache when it holds it, else
+// into the cache (or the scratch space without one). *bytes points at the segment's bytes.
+ssize_t readSegmentForCopy(const Target &target, const Names &names, uint32_t generation, uint64_t number,
+                           uint32_t segmentSize, const uint8_t **bytes) {
+  ReadCacheState *cache = tReadCache;
+  if (!cache) {
+    uint8_t *into = scratch();
+    *bytes = into;
+    return readSegment(target, names, generation, number, into, segmentSize);
+  }
+  std::string key = target.identity() + '\n' + names.segment(generation, number);
+  uint64_t epoch = gWriteEpoch.load(std::memory_order_relaxed);
+  for (ReadCacheState::Slot &slot : cache->slots) {
+    if (slot.bytes && slot.epoch == epoch && slot.key == key) {
+      *bytes = slot.bytes.get();
+      return slot.length;
+    }
+  }
+  ReadCacheState::Slot &slot = cache->slots[cache->next];
+  cache->next ^= 1;
+  if (!slot.bytes) slot.bytes.reset(new uint8_t[kLargestSegment]);
+  slot.key.clear();
+  ssize_t got = readSegment(target, names, generation, number, slot.bytes.get(), segmentSize);
+  if (got >= 0) {
+    slot.key = std::move(key);
+    slot.length = got;
+    slot.epoch = epoch;
+  }
+  *bytes = slot.bytes.get();
+  return got;
+}
+
+// Whether the thread's read cache saw this value segmented since the last write.
+bool knownSegmented(const Target &target, const Names &names) {
+  ReadCacheState *cache = tReadCache;
+  return cache && cache->segmentedEpoch == gWriteEpoch.load(std::memory_order_relaxed) &&
+         cache->segmentedValue == target.identity() + '\n' + names.index();
+}
+
+void rememberSegmented(const Target &target, const Names &names, bool segmented) {
+  ReadCacheState *cache = tReadCache;
+  if (!cache) return;
+  cache->segmentedValue = segmented ? target.identity() + '\n' + names.index() : std::string();
+  cache->segmentedEpoch = gWriteEpoch.load(std::memory_order_relaxed);
+}
+
 // Copies [position, position + count) of a segmented value into `out`. Returns 0, -1 with errno,
 // or 1 when the value was replaced meanwhile and the read must start over.
 int readSegmented(const Target &target, const Names &names, const Index &index, uint8_t *out, uint64_t position,
@@ -322,8 +394,8 @@ int readSegmented(const Target &target, const Names &names, const Index &index, 
       }
       if (got >= 0 && static_cast<uint64_t>(got) < to - from) memset(into + got, 0, to - from - got);
     } else {
-      uint8_t *bytes = scratch();
-      got = readSegment(target, names, index.generation, number, bytes, segmentSize);
+      const uint8_t *bytes = nullptr;
+      got = readSegmentForCopy(target, names, index.generation, number, static_cast<uint32_t>(segmentSize), &bytes);
       if (got >= 0) {
         uint64_t stored = static_cast<uint64_t>(got);
         uint64_t available = stored > from - start ? std::min(stored, to - start) - (from - start) : 0;
@@ -372,7 +444,7 @@ ssize_t getValue(const Target &target, const char *name, void *value, size_t siz
         memcpy(value, whole.data(), copied);
         return static_cast<ssize_t>(copied);
       }
-    } else {
+    } else if (!knownSegmented(target, names)) {
       std::vector<uint8_t> whole;
       if (readPlain(target, names, &whole)) {
         if (position >= whole.size()) return 0;
@@ -385,10 +457,16 @@ ssize_t getValue(const Target &target, const char *name, void *value, size_t siz
 
     Index index;
     int found = readIndex(target, names, &index);
+    if (found == 0 && knownSegmented(target, names)) {
+      // Replaced by a plain value since the cache saw it: start over with the plain form.
+      rememberSegmented(target, names, false);
+      continue;
+    }
     if (found <= 0) {
       if (found == 0) errno = ENODATA;
       return -1;
     }
+    if (fork && position != 0) rememberSegmented(target, names, true);
     if (!value) return static_cast<ssize_t>(index.length);
     uint64_t count;
     if (!fork) {
@@ -627,6 +705,16 @@ ssize_t flistxattr(int fd, char *names, size_t size, int options) {
     return -1;
   }
   return listValues(Target::ofFd(fd), names, size, options);
+}
+
+XattrReadCache::XattrReadCache() : active_(tReadCache == nullptr) {
+  if (active_) tReadCache = new ReadCacheState;
+}
+
+XattrReadCache::~XattrReadCache() {
+  if (!active_) return;
+  delete tReadCache;
+  tReadCache = nullptr;
 }
 
 }  // namespace platform

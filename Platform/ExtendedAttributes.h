@@ -77,6 +77,24 @@ struct XattrSegmentCounters {
 };
 XattrSegmentCounters &xattrSegmentCounters();
 
+// While an object of this class lives, positional reads of a segmented resource fork made by
+// its thread keep the last segments they read and serve later reads from them, so that a
+// reader going through a fork in small pieces (a chunk table entry, then the chunk, then the
+// next entry) reads each segment about once. The value's index record is still read on every
+// call, so a value replaced meanwhile is never served from the cache, and any attribute write
+// or removal made by this process empties it. Meant for one reader going through one file, as
+// decompression does; a second object on the same thread while one lives does nothing.
+class XattrReadCache {
+ public:
+  XattrReadCache();
+  ~XattrReadCache();
+  XattrReadCache(const XattrReadCache &) = delete;
+  XattrReadCache &operator=(const XattrReadCache &) = delete;
+
+ private:
+  bool active_;
+};
+
 // The Linux attribute name prefix of the layer's reserved names ("user.plzc#").
 extern const char kReservedLinuxPrefix[];
 

@@ -13,6 +13,7 @@
 #include "Libraries/CompressData/CompressData.h"
 #include "Libraries/CompressData/CompressorRegistry.h"
 #include "Libraries/CompressData/DiskHeader.h"
+#include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
 #include "Platform/Syscalls.h"
 #include "Plenzo.h"
@@ -53,6 +54,8 @@ struct timeval toTimeval(const struct timespec &time) {
 }  // namespace
 
 int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx) {
+  // The fork is read in small pieces (table entries, chunks): keep the segments they fall in.
+  platform::XattrReadCache segmentCache;
   int options = osSupportsDecmpfs() ? kShowCompressionOption : 0;
   int64_t size = fh->getxattr(fh, kDecmpfsXattrName, nullptr, 0, 0, options);
   if (size == -1) {
