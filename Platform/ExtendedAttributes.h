@@ -82,7 +82,8 @@ XattrSegmentCounters &xattrSegmentCounters();
 // reader going through a fork in small pieces (a chunk table entry, then the chunk, then the
 // next entry) reads each segment about once. The value's index record is still read on every
 // call, so a value replaced meanwhile is never served from the cache, and any attribute write
-// or removal made by this process empties it. Meant for one reader going through one file, as
+// or removal made by this process empties it. (Another process overwriting the value in place
+// during the read gives a torn read with or without the cache, as with a plain file.) Meant for one reader going through one file, as
 // decompression does; a second object on the same thread while one lives does nothing.
 class XattrReadCache {
  public:

@@ -1,6 +1,7 @@
 #include "Platform/ExtendedAttributes.h"
 
 #include <fcntl.h>
+#include <sys/wait.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
@@ -161,6 +162,58 @@ TEST_F(ExtendedAttributes, ReadingEightBytesTouchesAtMostTwoSegments) {
     EXPECT_LE(platform::xattrSegmentCounters().reads, 2u) << "at " << position;
     EXPECT_GE(platform::xattrSegmentCounters().reads, 1u);
   }
+}
+
+// A read cache serves small reads from the segments it holds, and never serves bytes that a
+// write of this process or a replacement by another process has changed. (Another process's
+// overwrite in place, meanwhile, is a torn read with or without the cache, as with plain files.)
+TEST_F(ExtendedAttributes, ReadCacheServesRepeatedReadsAndSeesEveryChange) {
+  std::vector<uint8_t> fork = randomBytes(8 * kPiece, 9);
+  writePiece(fork, 0, fork.size());
+  uint8_t bytes[8];
+  auto readAt = [&](size_t position) {
+    EXPECT_EQ(platform::getxattr(path.c_str(), kFork, bytes, 8, static_cast<uint32_t>(position), 0), 8);
+    return std::vector<uint8_t>(bytes, bytes + 8);
+  };
+  auto modelAt = [](const std::vector<uint8_t> &model, size_t position) {
+    return std::vector<uint8_t>(model.begin() + position, model.begin() + position + 8);
+  };
+
+  platform::XattrReadCache cache;
+  platform::xattrSegmentCounters() = {};
+  for (size_t position = 100; position < kPiece - 8; position += 997) EXPECT_EQ(readAt(position), modelAt(fork, position));
+  EXPECT_EQ(platform::xattrSegmentCounters().reads, 1u) << "one segment read, the rest from the cache";
+
+  // Our own write in place, inside the same generation of the value.
+  fork[200] ^= 0xFF;
+  writePiece(fork, 200, 1);
+  EXPECT_EQ(readAt(196), modelAt(fork, 196));
+
+  // Another process replaces the whole value.
+  std::vector<uint8_t> replacement = randomBytes(fork.size(), 10);
+  pid_t child = ::fork();
+  if (child == 0) {
+    int result = platform::removexattr(path.c_str(), kFork, 0) == 0 &&
+                         platform::setxattr(path.c_str(), kFork, replacement.data(), replacement.size(), 0, 0) == 0;
+    _exit(result ? 0 : 1);
+  }
+  int status = -1;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  ASSERT_EQ(status, 0);
+  EXPECT_EQ(readAt(196), modelAt(replacement, 196));
+  EXPECT_EQ(readAt(3 * kPiece + 5), modelAt(replacement, 3 * kPiece + 5));
+
+  // And then with a plain value, which the cache knew as segmented.
+  std::vector<uint8_t> small = randomBytes(1000, 11);
+  child = ::fork();
+  if (child == 0)
+    _exit(platform::removexattr(path.c_str(), kFork, 0) == 0 &&
+                  platform::setxattr(path.c_str(), kFork, small.data(), small.size(), 0, 0) == 0
+              ? 0
+              : 1);
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  ASSERT_EQ(status, 0);
+  EXPECT_EQ(readAt(500), modelAt(small, 500));
 }
 
 TEST_F(ExtendedAttributes, WholeReplacementSwitchesBetweenFormsWithoutLeftovers) {
