@@ -6,6 +6,14 @@
  * "com.tavix.decmpfs", the zlib chunks of larger files in "com.tavix.ResourceFork", and the
  * file carries the compressed flag 0x20 among its file flags.
  *
+ * Every chunk is one zlib-format stream (or a stored chunk), whichever engine wrote it, and
+ * every engine reads what any other wrote. The engine of a process is taken from the
+ * environment variable PLZC_ENGINE when the library is loaded: "libdeflate" (the default),
+ * "zlib" (the reference) or "isal" (the fastest, at a larger size: for speed over size, set
+ * PLZC_ENGINE=isal and use level 1). An unknown or unbuilt name is reported on standard error
+ * and the default used. Levels are zlib's 0 to 9; each engine maps them to its own so that
+ * libdeflate stores at least as small as zlib at every level.
+ *
  * Conventions of every function here: 0 for success and -1 for failure with errno set, a
  * pointer or NULL, or a count and -1, as each entry says. Diagnostics go to standard error and
  * name the file and the cause. Nothing here throws. The caller owns what it creates and
@@ -53,7 +61,7 @@ PLZC_EXPORT int VolumeSupportsCompression(const char *path);
 
 /* ---- Compressor context --------------------------------------------------------------- */
 
-/* The caller's choices for a series of compressions: types to try, zlib level, checksums,
+/* The caller's choices for a series of compressions: types to try, level, checksums,
  * in place or into a table-of-contents file; and statistics of what was done. */
 typedef struct CompressorContext CompressorContext;
 
