@@ -122,7 +122,7 @@ CompressionRules *_InitCompressionRules(PVRef userRules, PVRef systemRules) {
   if (systemRules && PVGetType(systemRules) != kPVTypeArray) return nullptr;
   PVArrayRef system = systemRules ? static_cast<PVArrayRef>(PVRetain(systemRules)) : _CopySystemRulesList();
   if (!system) return nullptr;
-  auto *rules = static_cast<CompressionRules *>(malloc(sizeof(CompressionRules)));
+  auto *rules = static_cast<CompressionRules *>(sys::malloc(sizeof(CompressionRules)));
   if (!rules) {
     PVRelease(system);
     return nullptr;

@@ -72,7 +72,7 @@ void reportInvalidItem(PVRef item, long index) {
   bool converted = false;
   if (text) {
     PVIndex size = PVStringGetMaximumSizeForEncoding(PVStringGetLength(text), kPVStringEncodingASCII) + 10;
-    char *buffer = static_cast<char *>(malloc(static_cast<size_t>(size)));
+    char *buffer = static_cast<char *>(sys::malloc(static_cast<size_t>(size)));
     if (buffer && PVStringGetCString(text, buffer, size, kPVStringEncodingASCII)) {
       PLZC_ERR("%s:%d: Error: invalid item '%s' at index %ld in SkipMachOFileTypes dictionary\n", buffer, index);
       converted = true;

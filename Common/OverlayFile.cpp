@@ -22,11 +22,13 @@ constexpr size_t kNameBufferSize = 500;
 struct Overlay {
   FileHandle handle;
   pthread_mutex_t dictLock;
-  FileHandle *base;
+  FileHandle *base;  // borrowed; null once detached
+  char *ownName;     // the name and path after detaching
   PVMutableDictionaryRef tocDict;
   uint8_t *unreadBuffer;
   int64_t unreadPos;
   int64_t unreadSize;
+  int unreadError;  // set when bytes to push back could not be kept: the data has a hole
 };
 
 Overlay *overlayOf(FileHandle *fh) { return static_cast<Overlay *>(fh->priv); }
@@ -47,6 +49,7 @@ int overlayClose(FileHandle *fh) {
   Overlay *overlay = overlayOf(fh);
   pthread_mutex_destroy(&overlay->dictLock);
   free(overlay->unreadBuffer);
+  free(overlay->ownName);
   PVRelease(overlay->tocDict);
   free(overlay);
   return 0;
@@ -59,9 +62,15 @@ int overlayReopen(FileHandle *, int) {
   return -1;
 }
 
+// What a detached overlay answers in place of its base.
+int64_t noBase() {
+  errno = EBADF;
+  return -1;
+}
+
 uint16_t overlayMode(FileHandle *fh) {
   FileHandle *base = overlayOf(fh)->base;
-  if (!base->mode) {
+  if (!base || !base->mode) {
     errno = EPERM;
     return 0;
   }
@@ -74,12 +83,12 @@ int overlayChflags(FileHandle *, uint32_t) { return 0; }
 
 int64_t overlaySize(FileHandle *fh) {
   FileHandle *base = overlayOf(fh)->base;
-  return base->size(base);
+  return base ? base->size(base) : noBase();
 }
 
 int64_t overlayBlockSize(FileHandle *fh) {
   FileHandle *base = overlayOf(fh)->base;
-  return base->blockSize(base);
+  return base ? base->blockSize(base) : 4096;
 }
 
 int64_t overlayPwrite(FileHandle *, const void *, int64_t, int64_t) {
@@ -99,6 +108,11 @@ int overlayTruncate(FileHandle *, int64_t length) {
 int64_t overlayPread(FileHandle *fh, void *buffer, int64_t count, int64_t offset) {
   Overlay *overlay = overlayOf(fh);
   FileHandle *base = overlay->base;
+  if (overlay->unreadError) {
+    errno = overlay->unreadError;
+    return -1;
+  }
+  if (!base) return noBase();
   if (!overlay->unreadBuffer) return base->pread(base, buffer, count, offset);
   if (offset != overlay->unreadPos) {
     PLZC_ERR("%s:%d: Error: should read the unread buffer first\n");
@@ -130,7 +144,10 @@ void *overlayUnreadAlloc(FileHandle *fh, int64_t size) {
     return nullptr;
   }
   overlay->unreadBuffer = static_cast<uint8_t *>(sys::malloc(size > 0 ? static_cast<size_t>(size) : 1));
-  if (!overlay->unreadBuffer) return nullptr;
+  if (!overlay->unreadBuffer) {
+    overlay->unreadError = ENOMEM;
+    return nullptr;
+  }
   overlay->unreadPos = 0;
   overlay->unreadSize = size;
   return overlay->unreadBuffer;
@@ -195,8 +212,9 @@ int64_t overlayGetxattr(FileHandle *fh, const char *name, void *buffer, uint64_t
   }
   PVMutableDataRef entry = getDataForAttr(fh, name, 0);
   if (!entry) {
+    if (errno != ENOATTR) return -1;  // not to be taken for a missing entry
     FileHandle *base = overlayOf(fh)->base;
-    return base->getxattr(base, name, buffer, size, position, options);
+    return base ? base->getxattr(base, name, buffer, size, position, options) : -1;
   }
   uint64_t length = static_cast<uint64_t>(PVDataGetLength(entry));
   if (!buffer || size == 0) {
@@ -283,7 +301,7 @@ const FileHandle kOverlayTemplate = {
 }  // namespace
 
 FileHandle *openTocFile(FileHandle *base, PVMutableDictionaryRef tocDict, int32_t canUnread) {
-  auto *overlay = static_cast<Overlay *>(calloc(1, sizeof(Overlay)));
+  auto *overlay = static_cast<Overlay *>(sys::calloc(1, sizeof(Overlay)));
   if (!overlay) return nullptr;
   overlay->handle = kOverlayTemplate;
   overlay->handle.name = base->name;
@@ -296,13 +314,32 @@ FileHandle *openTocFile(FileHandle *base, PVMutableDictionaryRef tocDict, int32_
   return &overlay->handle;
 }
 
+int overlayDetachBase(FileHandle *fh) {
+  Overlay *overlay = overlayOf(fh);
+  if (!overlay->base) return 0;
+  char *name = sys::strdup(fh->name ? fh->name : "");
+  if (!name) {
+    errno = ENOMEM;
+    return -1;
+  }
+  overlay->ownName = name;
+  fh->name = fh->path = name;
+  overlay->base = nullptr;
+  return 0;
+}
+
 PVMutableDataRef getDataForAttr(FileHandle *fh, const char *name, int32_t create) {
   Overlay *overlay = overlayOf(fh);
   PVStringRef key = PVStringCreateWithCString(name, kPVStringEncodingUTF8);
-  if (!key) return nullptr;
+  if (!key) {
+    errno = ENOMEM;
+    return nullptr;
+  }
   pthread_mutex_lock(&overlay->dictLock);
   auto *entry = static_cast<PVMutableDataRef>(const_cast<void *>(PVDictionaryGetValue(overlay->tocDict, key)));
+  int error = ENOATTR;
   if (!entry && create) {
+    error = ENOMEM;
     entry = PVDataCreateMutable(0);
     if (entry) {
       if (PVDictionarySetValue(overlay->tocDict, key, entry)) {
@@ -315,6 +352,7 @@ PVMutableDataRef getDataForAttr(FileHandle *fh, const char *name, int32_t create
   }
   pthread_mutex_unlock(&overlay->dictLock);
   PVRelease(key);
+  if (!entry) errno = error;
   return entry;
 }
 

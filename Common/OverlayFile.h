@@ -5,7 +5,8 @@
 // answered from the dictionary, and from the base for names it does not hold. Data writes,
 // truncation to a non-zero length and reopening are refused (EPERM); time and flag changes are
 // accepted and ignored. An unread buffer lets a reader push consumed bytes back, so that the
-// next reader of a read-once base starts again at offset 0.
+// next reader of a read-once base starts again at offset 0; when no memory can be had for it,
+// the bytes cannot come back and every later read fails with ENOMEM.
 //
 // The resource fork may be written at any position (it grows with zeros); every other
 // attribute is written whole and holds at most 3802 bytes (ERANGE beyond). A removed
@@ -22,8 +23,17 @@
 // overlay until it closes. canUnread enables the unread operations. NULL when out of memory.
 FileHandle *openTocFile(FileHandle *base, PVMutableDictionaryRef tocDict, int32_t canUnread);
 
+// Makes the overlay independent of its base, so that the base may be closed while the overlay
+// lives on with the compressed form it captured: the overlay takes its own copy of the base's
+// name (its name and path from then on) and answers what it would have asked the base for
+// (attributes it does not hold, data, size) as a handle with nothing behind it: ENOATTR for
+// attributes, EBADF otherwise. 0, or -1 with ENOMEM when the copy cannot be made (the overlay
+// then still needs its base).
+int overlayDetachBase(FileHandle *overlay);
+
 // The entry for name in the overlay's dictionary, borrowed; created empty when absent and
-// create is non-zero, else NULL when absent.
+// create is non-zero, else NULL with errno ENOATTR when absent. NULL with ENOMEM when out of
+// memory.
 PVMutableDataRef getDataForAttr(FileHandle *overlay, const char *name, int32_t create);
 
 // Sets every non-empty entry as an attribute of fd. 0; or -1 with errno after removing every

@@ -6,7 +6,6 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
-#include <new>
 
 #include "Common/Diagnostics.h"
 #include "Common/FileHandle.h"
@@ -32,7 +31,7 @@ int plainClose(FileHandle *fh) {
   int savedErrno = errno;
   free(fh->name);
   free(fh->path);
-  delete reinterpret_cast<PlainFile *>(fh);
+  free(reinterpret_cast<PlainFile *>(fh));
   errno = savedErrno;
   return result;
 }
@@ -186,17 +185,19 @@ FileHandle *openFile(const char *name, const char *path, int oflag) {
     PLZC_ERR("%s:%d: open %s: %s\n", path, strerror(errno));
     return nullptr;
   }
-  auto *file = new (std::nothrow) PlainFile{kPlainFileTemplate, fd};
-  char *nameCopy = strdup(name);
-  char *pathCopy = strdup(path);
+  auto *file = static_cast<PlainFile *>(sys::malloc(sizeof(PlainFile)));
+  char *nameCopy = sys::strdup(name);
+  char *pathCopy = sys::strdup(path);
   if (!file || !nameCopy || !pathCopy) {
     sys::close(fd);
-    delete file;
+    free(file);
     free(nameCopy);
     free(pathCopy);
     errno = ENOMEM;
+    PLZC_ERR("%s:%d: open %s: %s\n", path, strerror(errno));
     return nullptr;
   }
+  *file = PlainFile{kPlainFileTemplate, fd};
   file->handle.name = nameCopy;
   file->handle.path = pathCopy;
   file->handle.priv = &file->fd;

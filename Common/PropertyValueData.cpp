@@ -3,6 +3,7 @@
 #include <cstring>
 
 #include "Common/PropertyValueObjects.h"
+#include "Platform/Syscalls.h"
 #include "PropertyValue.h"
 
 namespace {
@@ -13,7 +14,7 @@ bool reserve(PVData *data, PVIndex needed) {
   if (needed <= data->capacity) return true;
   PVIndex capacity = data->capacity < 16 ? 16 : data->capacity;
   while (capacity < needed) capacity = capacity > PTRDIFF_MAX / 2 ? needed : capacity * 2;
-  auto *bytes = static_cast<uint8_t *>(realloc(data->bytes, static_cast<size_t>(capacity)));
+  auto *bytes = static_cast<uint8_t *>(sys::realloc(data->bytes, static_cast<size_t>(capacity)));
   if (!bytes) return false;
   data->bytes = bytes;
   data->capacity = capacity;
@@ -26,7 +27,7 @@ PVData *create(const void *bytes, PVIndex length, PVIndex capacity, bool isMutab
   if (!data) return nullptr;
   PVIndex size = length > capacity ? length : capacity;
   if (size > 0) {
-    data->bytes = static_cast<uint8_t *>(malloc(static_cast<size_t>(size)));
+    data->bytes = static_cast<uint8_t *>(sys::malloc(static_cast<size_t>(size)));
     if (!data->bytes) {
       delete data;
       return nullptr;
@@ -115,7 +116,7 @@ bool PVDataReplaceBytes(PVMutableDataRef data, PVRange range, const void *newByt
                 sourceAddress < ownAddress + static_cast<uintptr_t>(d->length);
   uint8_t *aside = nullptr;
   if (inside) {
-    aside = static_cast<uint8_t *>(malloc(static_cast<size_t>(newLength)));
+    aside = static_cast<uint8_t *>(sys::malloc(static_cast<size_t>(newLength)));
     if (!aside) return false;
     memcpy(aside, source, static_cast<size_t>(newLength));
     source = aside;

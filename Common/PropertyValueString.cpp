@@ -4,6 +4,7 @@
 #include <string_view>
 
 #include "Common/PropertyValueObjects.h"
+#include "Platform/Syscalls.h"
 #include "PropertyValue.h"
 
 namespace {
@@ -58,7 +59,7 @@ bool copyOut(const PVString *string, char *buffer, PVIndex bufferSize, bool asci
 namespace pv {
 
 PVStringRef createStringFromValidUTF8(const char *bytes, size_t length) {
-  auto *copy = static_cast<char *>(malloc(length + 1));
+  auto *copy = static_cast<char *>(sys::malloc(length + 1));
   if (!copy) return nullptr;
   if (length) memcpy(copy, bytes, length);
   copy[length] = '\0';

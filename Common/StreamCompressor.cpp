@@ -7,8 +7,10 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <new>
 
 #include "Common/Diagnostics.h"
 #include "Common/MachOFilter.h"
@@ -57,6 +59,20 @@ void _InitStreamCompression() {
 }
 
 void _EmptyFunction(void *) {}
+
+// Queue and stream records come from sys::malloc, so that tests can make their allocation fail.
+template <typename Record>
+Record *newRecord() {
+  void *block = sys::malloc(sizeof(Record));
+  return block ? new (block) Record : nullptr;
+}
+
+template <typename Record>
+void deleteRecord(Record *record) {
+  if (!record) return;
+  record->~Record();
+  free(record);
+}
 
 void recordError(StreamCompressorQueue *queue, int error) { queue->error.store(error, std::memory_order_relaxed); }
 
@@ -111,7 +127,10 @@ void _SCEnqueueWriter(StreamCompressor *stream, int direct) {
 
 int _SCWriteFailed(int64_t offset, const void *bytes, int64_t count, void *context) {
   auto *stream = static_cast<StreamCompressor *>(context);
-  return sys::pwrite(stream->fd, bytes, static_cast<size_t>(count), offset) == count ? 0 : -1;
+  ssize_t written = sys::pwrite(stream->fd, bytes, static_cast<size_t>(count), offset);
+  if (written == count) return 0;
+  if (written >= 0) errno = ENOSPC;  // a regular file takes fewer bytes only when the disk is full
+  return -1;
 }
 
 void _SCCompressFile(void *context) {
@@ -137,8 +156,12 @@ void _SCCompressFile(void *context) {
   }
 
   if (compressed) {
+    // The overlay holds the compressed form and outlives the pool handle it was laid over.
     stream->handle = overlay;
-    closeHandle(&poolHandle);
+    if (overlayDetachBase(overlay) == 0)
+      closeHandle(&poolHandle);
+    else
+      stream->poolHandle = poolHandle;  // no memory to detach: the write-out closes it
     stream->tocDict = dictionary;
     dropPoolReference(stream);
     queue->completed.fetch_add(1);
@@ -174,80 +197,50 @@ void _SCCompressFile(void *context) {
 bool storeCompressedForm(StreamCompressor *stream) {
   StreamCompressorQueue *queue = stream->queue;
   bool success = false;
-  uint8_t *savedFork = nullptr;
-  int64_t savedForkSize = 0;
-  bool forkUnreadable = false;
-
   ssize_t forkSize = platform::fgetxattr(stream->fd, kResourceForkXattrName, nullptr, 0, 0, 0);
   if (forkSize < 0 && errno != ENOATTR) {
+    // A fork that cannot be sized may be the caller's own: the compressed form would replace it.
     recordError(queue, errno);
     PLZC_ERR("%s:%d: Error: fgetxattr failed for %s: %s\n", stream->path, strerror(errno));
   } else if (forkSize > 0) {
-    // The caller gave the file a resource fork of its own: keep its bytes in hand.
-    savedFork = static_cast<uint8_t *>(sys::malloc(static_cast<size_t>(forkSize)));
-    ssize_t got = savedFork ? platform::fgetxattr(stream->fd, kResourceForkXattrName, savedFork,
-                                                  static_cast<size_t>(forkSize), 0, 0)
-                            : -1;
-    if (got < 0) {
-      if (!savedFork) errno = ENOMEM;
-      recordError(queue, errno);
-      PLZC_ERR("%s:%d: Error: fgetxattr failed for %s: %s\n", stream->path, strerror(errno));
-      forkUnreadable = true;
-    } else {
-      savedForkSize = got;
-      if (platform::fremovexattr(stream->fd, kResourceForkXattrName, 0) != 0)
-        PLZC_ERR("%s:%d: fremovexattr failed for %s: %s\n", stream->path, strerror(errno));
+    // The caller gave the file a resource fork of its own, so the file never ends compressed:
+    // plain data, the caller's fork, no compression attributes. No Linux file system expands a
+    // compressed file whose fork is rewritten, so the write-out reaches that state directly and
+    // never takes the caller's fork off the file: a new file gets its data decompressed from the
+    // compressed form, an existing one keeps its data fork.
+    if (!queue->inPlace && decompressData(stream->handle, _SCWriteFailed, stream) == -1) {
+      recordError(queue, errno ? errno : EIO);
+      PLZC_ERR("%s:%d: Error: decompressData failed for %s\n", stream->path);
     }
-  }
-
-  // A fork that could not be read stays as it is: the compressed form would overwrite it.
-  if (!forkUnreadable) {
-    if (applyTocDictToFd(stream->fd, stream->tocDict) == 0) {
-      if (!queue->inPlace) {
-        success = true;
-      } else if (sys::truncate(stream->path, 0) != 0) {
-        recordError(queue, errno);
-        PLZC_ERR("%s:%d: Error: ftruncate failed for %s: %s\n", stream->path, strerror(errno));
-      } else {
-        success = true;
-      }
+  } else if (applyTocDictToFd(stream->fd, stream->tocDict) == 0) {
+    if (!queue->inPlace) {
+      success = true;
+    } else if (sys::truncate(stream->path, 0) != 0) {
+      recordError(queue, errno);
+      PLZC_ERR("%s:%d: Error: ftruncate failed for %s: %s\n", stream->path, strerror(errno));
     } else {
-      int error = errno;
-      if (queue->ignoreXattrErrors && !queue->inPlace) {
-        PLZC_ERR("%s:%d: Compressed data for %s could not be written; writing decompressed data: %s\n", stream->path,
-                 strerror(error));
-        if (decompressData(stream->handle, _SCWriteFailed, stream) == -1) {
-          PLZC_ERR("%s:%d: Error: decompressData failed for %s\n", stream->path);
-          recordError(queue, error);
-        }
-      } else if (queue->ignoreXattrErrors) {
-        PLZC_ERR("%s:%d: Compressed data for %s could not be written: %s\n", stream->path, strerror(error));
-      } else {
+      success = true;
+    }
+  } else {
+    int error = errno;
+    if (queue->ignoreXattrErrors && !queue->inPlace) {
+      PLZC_ERR("%s:%d: Compressed data for %s could not be written; writing decompressed data: %s\n", stream->path,
+               strerror(error));
+      if (decompressData(stream->handle, _SCWriteFailed, stream) == -1) {
+        PLZC_ERR("%s:%d: Error: decompressData failed for %s\n", stream->path);
         recordError(queue, error);
-        PLZC_ERR("%s:%d: Error: applyTocDictToFd failed for %s: %s\n", stream->path, strerror(error));
       }
+    } else if (queue->ignoreXattrErrors) {
+      PLZC_ERR("%s:%d: Compressed data for %s could not be written: %s\n", stream->path, strerror(error));
+    } else {
+      recordError(queue, error);
+      PLZC_ERR("%s:%d: Error: applyTocDictToFd failed for %s: %s\n", stream->path, strerror(error));
     }
   }
   PVRelease(stream->tocDict);
   stream->tocDict = nullptr;
-
-  if (savedFork && !forkUnreadable) {
-    // A file with a resource fork of its own never ends compressed. No Linux file system
-    // expands such a file by itself: put its data back into the data fork, drop the compressed
-    // form, then write the caller's fork back.
-    success = false;
-    if (decompressData(stream->handle, _SCWriteFailed, stream) == -1)
-      PLZC_ERR("%s:%d: Error: decompressData failed for %s\n", stream->path);
-    platform::fremovexattr(stream->fd, kDecmpfsXattrName, 0);
-    platform::fremovexattr(stream->fd, kResourceForkXattrName, 0);
-    if (platform::fsetxattr(stream->fd, kResourceForkXattrName, savedFork, static_cast<size_t>(savedForkSize), 0,
-                            0) != 0) {
-      recordError(queue, errno);
-      PLZC_ERR("%s:%d: Error: fsetxattr failed for %s: %s\n", stream->path, strerror(errno));
-    }
-  }
-  free(savedFork);
   closeHandle(&stream->handle);
+  closeHandle(&stream->poolHandle);
   return success;
 }
 
@@ -341,13 +334,13 @@ void _SCWriteFile(void *context) {
 
 StreamCompressorQueue *CreateStreamCompressorQueueWithOptions(PVDictionaryRef options) {
   pthread_once(&initStreamCompressionOnce, _InitStreamCompression);
-  auto *queue = new (std::nothrow) StreamCompressorQueue;
+  auto *queue = newRecord<StreamCompressorQueue>();
   if (!queue) return nullptr;
   if (!options) return queue;
   queue->options = static_cast<PVDictionaryRef>(PVRetain(options));
   if (_ComputeMachOTypeMask(&queue->skipMachOTypeMask, options) == -1) {
     PVRelease(queue->options);
-    delete queue;
+    deleteRecord(queue);
     return nullptr;
   }
   queue->skipMachOOverridePaths = createMachOOverridePaths(queue->skipMachOTypeMask, options);
@@ -380,7 +373,7 @@ bool _SQLazyInit(StreamCompressorQueue *queue) {
       auto string = static_cast<PVStringRef>(value);
       PVIndex size = PVStringGetMaximumSizeForEncoding(PVStringGetLength(string), kPVStringEncodingASCII) + 10;
       typesText = size <= static_cast<PVIndex>(sizeof typesBuffer) ? typesBuffer
-                                                                    : static_cast<char *>(malloc(static_cast<size_t>(size)));
+                                                                    : static_cast<char *>(sys::malloc(static_cast<size_t>(size)));
       if (!typesText || !PVStringGetCString(string, typesText, size, kPVStringEncodingASCII)) {
         if (typesText != typesBuffer) free(typesText);
         return false;  // not even recorded: the caller's types cannot be used
@@ -449,7 +442,7 @@ void _SQRelease(StreamCompressorQueue *queue) {
   PVRelease(queue->skipMachOOverridePaths);
   workQueueRelease(queue->managerQueue);
   workQueueRelease(queue->ioQueue);
-  delete queue;
+  deleteRecord(queue);
 }
 
 int FinishStreamCompressorQueue(StreamCompressorQueue *queue) {
@@ -490,8 +483,11 @@ int FinishStreamCompressorQueue(StreamCompressorQueue *queue) {
 }
 
 FileHandle *_SCHandleForPool(StreamCompressor *stream) {
-  char *name = nullptr;
-  if (asprintf(&name, "data pool for %s", stream->path) < 0) return nullptr;
+  static constexpr char kFormat[] = "data pool for %s";
+  size_t size = sizeof kFormat + strlen(stream->path);
+  auto *name = static_cast<char *>(sys::malloc(size));
+  if (!name) return nullptr;
+  snprintf(name, size, kFormat, stream->path);
   FileHandle *handle = openDataPoolFile(stream->pool, name);
   free(name);
   return handle;
@@ -511,17 +507,18 @@ StreamCompressor *CreateStreamCompressor(int fd, const char *path, const char *p
     PLZC_ERR("%s:%d: dup: %s\n", strerror(errno));
     return nullptr;
   }
-  auto *stream = new (std::nothrow) StreamCompressor;
-  char *pathCopy = strdup(path);
-  char *prefixCopy = prefix ? strdup(prefix) : nullptr;
+  auto *stream = newRecord<StreamCompressor>();
+  char *pathCopy = sys::strdup(path);
+  char *prefixCopy = prefix ? sys::strdup(prefix) : nullptr;
   DataPool *pool = stream && pathCopy && (!prefix || prefixCopy) ? newDataPool(expectedSize) : nullptr;
   if (!pool) {
     // Out of memory: nothing was submitted, give everything back.
-    delete stream;
+    deleteRecord(stream);
     free(pathCopy);
     free(prefixCopy);
     closeAndSignal(duplicate);
     errno = ENOMEM;
+    PLZC_ERR("%s:%d: Error: cannot create a stream for %s: %s\n", path, strerror(errno));
     return nullptr;
   }
   stream->fd = duplicate;
@@ -532,9 +529,10 @@ StreamCompressor *CreateStreamCompressor(int fd, const char *path, const char *p
     releaseDataPool(pool);
     free(pathCopy);
     free(prefixCopy);
-    delete stream;
+    deleteRecord(stream);
     closeAndSignal(duplicate);
     errno = ENOMEM;
+    PLZC_ERR("%s:%d: Error: cannot create a stream for %s: %s\n", path, strerror(errno));
     return nullptr;
   }
   stream->queue = queue;
@@ -600,5 +598,5 @@ void _SCRelease(StreamCompressor *stream) {
   if (stream->pool) PLZC_ERR("%s:%d: Error: pool %p was not drained for %s\n", static_cast<void *>(stream->pool), stream->path);
   free(stream->path);
   free(stream->prefix);
-  delete stream;
+  deleteRecord(stream);
 }

@@ -5,6 +5,7 @@
 #include <sys/time.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -23,7 +24,7 @@ constexpr uint64_t kSmallestMemoryBudget = 104857600;
 constexpr uint64_t kDescriptorRaise = 64;
 constexpr uint64_t kHighestSoftLimit = 10240;
 constexpr uint64_t kSmallestDescriptorBudget = 10;
-constexpr int kTooManyFilesWaitSeconds = 5;
+
 
 uint64_t totalPoolAllocs = 0;
 uint64_t maxPoolAllocs = 0;
@@ -35,6 +36,7 @@ uint64_t max_fds = 0;
 pthread_mutex_t compressorFdsLock = PTHREAD_MUTEX_INITIALIZER;
 pthread_cond_t compressorFdsCond = PTHREAD_COND_INITIALIZER;
 pthread_once_t once_rlimit = PTHREAD_ONCE_INIT;
+std::atomic<uint32_t> tooManyFilesWaitMs{5000};
 
 void computeMemoryBudget() {
   uint64_t memory;
@@ -131,7 +133,9 @@ int32_t waitThenDupOrOpen(const char *path, int32_t fd) {
       PLZC_ERR("%s:%d: gettimeofday: %s\n", strerror(errno));
       continue;
     }
-    struct timespec deadline = {now.tv_sec + kTooManyFilesWaitSeconds, now.tv_usec * 1000};
+    uint64_t deadlineUs = static_cast<uint64_t>(now.tv_usec) + tooManyFilesWaitMs.load(std::memory_order_relaxed) * 1000ull;
+    struct timespec deadline = {now.tv_sec + static_cast<time_t>(deadlineUs / 1000000),
+                                static_cast<long>(deadlineUs % 1000000) * 1000};
     pthread_cond_timedwait(&compressorFdsCond, &compressorFdsLock, &deadline);
   }
 }
@@ -140,11 +144,11 @@ int32_t closeAndSignal(int32_t fd) {
   if (fd < 1) return 0;
   pthread_mutex_lock(&compressorFdsLock);
   int result = sys::close(fd);
-  if (result == 0) {
-    compressorFdsCount--;
-    pthread_cond_signal(&compressorFdsCond);
-  }
   int savedErrno = errno;
+  // Linux releases the descriptor even when close reports an error (EIO, EINTR): keeping the
+  // charge would lose a place in the budget for good, and with it, one day, every opener.
+  compressorFdsCount--;
+  pthread_cond_signal(&compressorFdsCond);
   pthread_mutex_unlock(&compressorFdsLock);
   errno = savedErrno;
   return result;
@@ -183,3 +187,5 @@ void throttlingSetMemoryBudget(uint64_t budget) {
   pthread_mutex_unlock(&totalPoolAllocsLock);
   pthread_cond_broadcast(&totalPoolAllocsCond);
 }
+
+void throttlingSetTooManyFilesWait(uint32_t waitMs) { tooManyFilesWaitMs.store(waitMs, std::memory_order_relaxed); }

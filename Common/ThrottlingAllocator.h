@@ -22,8 +22,9 @@ void freeAndSignal(void *block, uint64_t size);
 // reported. Returns the descriptor, or -1 with errno after a message.
 int32_t waitThenDupOrOpen(const char *path, int32_t fd);
 
-// Closes a descriptor from waitThenDupOrOpen and gives it back. 0 for fd below 1 (nothing
-// done), else the result of close.
+// Closes a descriptor from waitThenDupOrOpen and gives it back, also when close reports an
+// error (the descriptor is released all the same). 0 for fd below 1 (nothing done), else the
+// result of close.
 int32_t closeAndSignal(int32_t fd);
 
 // The budgets, for tests and diagnostics.
@@ -39,3 +40,5 @@ void descriptorBudgetFor(uint64_t soft, uint64_t hard, uint64_t *newSoft, uint64
 
 // Fixes the memory budget before first use (tests only).
 void throttlingSetMemoryBudget(uint64_t budget);
+// Shortens the wait after too many open files (5000 ms) for tests that cause that on purpose.
+void throttlingSetTooManyFilesWait(uint32_t waitMs);

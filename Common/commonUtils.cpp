@@ -73,7 +73,7 @@ void giveBack(FileHandle *handle, const ConsumedInput &consumed, uint32_t chunkS
     }
     handle->unreadSetPos(handle, rebuilt);
   }
-  handle->unread(handle, consumed.lastBytes, consumed.lastCount);
+  if (consumed.lastCount > 0) handle->unread(handle, consumed.lastBytes, consumed.lastCount);
   handle->unreadDone(handle);
 }
 
@@ -183,6 +183,12 @@ int chunkingCompressor(FileHandle *handle, int32_t maxChunks, uint32_t chunkSize
   if (failed && consumed.totalRead != 0 && handle->canUnread)
     giveBack(handle, consumed, chunkSize, prefixBytes, suffixBytes, state, supplyChunk);
   return result;
+}
+
+void chunkingGiveBackAll(FileHandle *handle, int64_t size, uint32_t chunkSize, int32_t prefixBytes,
+                         int32_t suffixBytes, void *state, SupplyChunkFn supplyChunk) {
+  if (!handle->canUnread || size <= 0) return;
+  giveBack(handle, ConsumedInput{size, size, 0, nullptr}, chunkSize, prefixBytes, suffixBytes, state, supplyChunk);
 }
 
 int64_t chunkingDecompressor(int64_t offset, uint64_t size, uint32_t vectorCount, const struct iovec *vectors,

@@ -35,6 +35,13 @@ int chunkingCompressor(FileHandle *handle, int32_t maxChunks, uint32_t chunkSize
                        int32_t prefixBytes, int32_t suffixBytes, void *state, EmitBytesFn emitBytes,
                        SupplyChunkFn supplyChunk, int32_t level);
 
+// For a type that fails in its own last steps after chunkingCompressor consumed the whole file
+// (size bytes) and emitted every chunk: gives the file back to a handle with canUnread, rebuilt
+// from the emitted chunks through supplyChunk, so that the next reader still gets every byte.
+// Does nothing on other handles. A rebuild that falls short is reported and gives back less.
+void chunkingGiveBackAll(FileHandle *handle, int64_t size, uint32_t chunkSize, int32_t prefixBytes,
+                         int32_t suffixBytes, void *state, SupplyChunkFn supplyChunk);
+
 // Decompresses size bytes from offset into the vectors (which together hold exactly size
 // bytes), fetching chunks through supplyChunk. Returns the bytes written (fewer than size when
 // the chunks end first), or -1.

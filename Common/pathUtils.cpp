@@ -13,7 +13,7 @@
 static constexpr char kSourcePath[] = "Common/pathUtils";
 
 int mkdirRecursive(const char *path) {
-  char *copy = strdup(path);
+  char *copy = sys::strdup(path);
   if (!copy) return -1;
   // A leading '/' is never a cut point.
   for (char *slash = strchr(copy + (copy[0] ? 1 : 0), '/'); slash; slash = strchr(slash + 1, '/')) {

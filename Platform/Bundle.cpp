@@ -7,13 +7,15 @@
 #include <cstdlib>
 #include <string>
 
+#include "Platform/Syscalls.h"
+
 namespace platform {
 
 namespace {
 
 bool isDirectory(const std::string &path) {
   struct stat st;
-  return stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+  return sys::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
 }
 
 // The directory of the object this code was loaded from (the shared library, or the program
@@ -22,7 +24,7 @@ std::string loadedObjectDirectory() {
   Dl_info info;
   if (!dladdr(reinterpret_cast<void *>(&bundleDirectory), &info) || !info.dli_fname) return "";
   char resolved[PATH_MAX];
-  if (!realpath(info.dli_fname, resolved)) return "";
+  if (!sys::realpath(info.dli_fname, resolved)) return "";
   std::string path = resolved;
   return path.substr(0, path.rfind('/'));
 }
@@ -41,7 +43,7 @@ bool bundleResourcePath(const char *bundleIdentifier, const char *name, const ch
   if (directory.empty()) return false;
   std::string candidate = directory + "/" + name + "." + type;
   struct stat st;
-  if (stat(candidate.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) return false;
+  if (sys::stat(candidate.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) return false;
   *path = candidate;
   return true;
 }

@@ -179,15 +179,19 @@ bool validOptions(int options) {
   return true;
 }
 
-// Reads the index of a segmented value: 1 when found, 0 when the value is not segmented,
-// -1 with errno on failure (EIO for a damaged record).
+constexpr int kDamagedIndex = -2;
+
+// Reads the index of a segmented value: 1 when found, 0 when the value is not segmented, -1
+// with errno when the read failed, kDamagedIndex (errno EIO) for a record that is not an
+// index. Only a damaged record may be written over: a read that failed, even with EIO, says
+// nothing about the value, which may well be intact.
 int readIndex(const Target &target, const Names &names, Index *index) {
   ssize_t got = target.get(names.index(), index, sizeof *index);
   if (got < 0) return errno == ENODATA ? 0 : -1;
   if (got != sizeof *index || index->magic != kIndexMagic || index->version != kIndexVersion ||
       index->segmentSize < 1024 || index->segmentSize > kLargestSegment) {
     errno = EIO;
-    return -1;
+    return kDamagedIndex;
   }
   return 1;
 }
@@ -283,17 +287,21 @@ int writeNewGeneration(const Target &target, const Names &names, uint32_t segmen
   return 0;
 }
 
-// Publishes a new generation of segments in place of whatever the value was.
+// Publishes a new generation of segments in place of whatever the value was. Readers take a
+// plain value before an index, so a value that was plain changes only when its plain form is
+// gone: if that cannot be removed, the new generation is withdrawn and the old value stays.
 int publishSegmented(const Target &target, const Names &names, uint32_t segmentSize, uint32_t generation,
                      uint64_t length, bool hadPlain, bool hadIndex) {
-  if (writeIndex(target, names, segmentSize, generation, length) != 0) {
+  auto withdraw = [&](bool indexWritten) {
     int saved = errno;
+    if (indexWritten) target.remove(names.index());
     for (uint64_t number = 0; number * segmentSize < length; number++)
       target.remove(names.segment(generation, number));
     errno = saved;
     return -1;
-  }
-  if (hadPlain) target.remove(names.plain());
+  };
+  if (writeIndex(target, names, segmentSize, generation, length) != 0) return withdraw(false);
+  if (hadPlain && target.remove(names.plain()) != 0 && errno != ENODATA) return withdraw(true);
   if (hadIndex) removeSegments(target, names, generation);
   return 0;
 }
@@ -586,7 +594,7 @@ int setValue(const Target &target, const char *name, const void *value, size_t s
   if (plainSize < 0 && errno != ENODATA) return -1;
   Index index;
   int indexed = readIndex(target, names, &index);
-  if (indexed < 0 && errno != EIO) return -1;
+  if (indexed == -1) return -1;
   bool exists = plainSize >= 0 || indexed != 0;
   if ((options & kXattrCreate) && exists) {
     errno = EEXIST;

@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 
 namespace sys {
 namespace {
@@ -59,18 +60,35 @@ uint64_t callCount(Call call) {
     return expression;                          \
   } while (0)
 
-int open(const char *path, int flags, mode_t mode) { PLZC_WRAP(Open, -1, ::open(path, flags, mode)); }
-int close(int fd) { PLZC_WRAP(Close, -1, ::close(fd)); }
-ssize_t read(int fd, void *buffer, size_t count) { PLZC_WRAP(Read, -1, ::read(fd, buffer, count)); }
-ssize_t write(int fd, const void *buffer, size_t count) { PLZC_WRAP(Write, -1, ::write(fd, buffer, count)); }
+// Like PLZC_WRAP, restarting the call (injected failures included) while it fails with EINTR.
+#define PLZC_WRAP_RESTARTING(call, expression)          \
+  do {                                                   \
+    for (;;) {                                           \
+      auto result = injected(Call::call) ? -1 : (expression); \
+      if (result != -1 || errno != EINTR) return result; \
+    }                                                    \
+  } while (0)
+
+int open(const char *path, int flags, mode_t mode) { PLZC_WRAP_RESTARTING(Open, ::open(path, flags, mode)); }
+int close(int fd) {
+  if (injected(Call::Close)) {
+    int error = errno;
+    ::close(fd);
+    errno = error;
+    return -1;
+  }
+  return ::close(fd);
+}
+ssize_t read(int fd, void *buffer, size_t count) { PLZC_WRAP_RESTARTING(Read, ::read(fd, buffer, count)); }
+ssize_t write(int fd, const void *buffer, size_t count) { PLZC_WRAP_RESTARTING(Write, ::write(fd, buffer, count)); }
 ssize_t pread(int fd, void *buffer, size_t count, off_t offset) {
-  PLZC_WRAP(Pread, -1, ::pread(fd, buffer, count, offset));
+  PLZC_WRAP_RESTARTING(Pread, ::pread(fd, buffer, count, offset));
 }
 ssize_t pwrite(int fd, const void *buffer, size_t count, off_t offset) {
-  PLZC_WRAP(Pwrite, -1, ::pwrite(fd, buffer, count, offset));
+  PLZC_WRAP_RESTARTING(Pwrite, ::pwrite(fd, buffer, count, offset));
 }
-int ftruncate(int fd, off_t length) { PLZC_WRAP(Ftruncate, -1, ::ftruncate(fd, length)); }
-int truncate(const char *path, off_t length) { PLZC_WRAP(Truncate, -1, ::truncate(path, length)); }
+int ftruncate(int fd, off_t length) { PLZC_WRAP_RESTARTING(Ftruncate, ::ftruncate(fd, length)); }
+int truncate(const char *path, off_t length) { PLZC_WRAP_RESTARTING(Truncate, ::truncate(path, length)); }
 int stat(const char *path, struct ::stat *st) { PLZC_WRAP(Stat, -1, ::stat(path, st)); }
 int lstat(const char *path, struct ::stat *st) { PLZC_WRAP(Lstat, -1, ::lstat(path, st)); }
 int fstat(int fd, struct ::stat *st) { PLZC_WRAP(Fstat, -1, ::fstat(fd, st)); }
@@ -111,6 +129,8 @@ int rename(const char *from, const char *to) { PLZC_WRAP(Rename, -1, ::rename(fr
 int mkdir(const char *path, mode_t mode) { PLZC_WRAP(Mkdir, -1, ::mkdir(path, mode)); }
 char *realpath(const char *path, char *resolved) { PLZC_WRAP(Realpath, nullptr, ::realpath(path, resolved)); }
 void *malloc(size_t size) { PLZC_WRAP(Malloc, nullptr, ::malloc(size)); }
+void *realloc(void *block, size_t size) { PLZC_WRAP(Malloc, nullptr, ::realloc(block, size)); }
+char *strdup(const char *text) { PLZC_WRAP(Malloc, nullptr, ::strdup(text)); }
 void *calloc(size_t count, size_t size) { PLZC_WRAP(Calloc, nullptr, ::calloc(count, size)); }
 int dup(int fd) { PLZC_WRAP(Dup, -1, ::dup(fd)); }
 off_t lseek(int fd, off_t offset, int whence) { PLZC_WRAP(Lseek, -1, ::lseek(fd, offset, whence)); }
@@ -118,5 +138,6 @@ int chmod(const char *path, mode_t mode) { PLZC_WRAP(Chmod, -1, ::chmod(path, mo
 int utimes(const char *path, const struct timeval times[2]) { PLZC_WRAP(Utimes, -1, ::utimes(path, times)); }
 
 #undef PLZC_WRAP
+#undef PLZC_WRAP_RESTARTING
 
 }  // namespace sys

@@ -4,6 +4,15 @@
 // of namespace `sys`, never straight to the C library. Each wrapper counts its calls and can be
 // told to fail: tests arm a fault ("the 3rd pwrite fails with ENOSPC") and every error path of
 // the library can then be driven on a real file system, without mocks of whole components.
+//
+// Two Linux rules are kept here, once for the whole library:
+// - open, read, write, pread, pwrite, truncate and ftruncate are restarted when a signal
+//   interrupts them (EINTR) before they transferred anything. Regular files on local file
+//   systems never do that, but the paths the library is given may name FIFOs or devices, and
+//   standard output may be a pipe. An injected EINTR is restarted the same way (the restart is
+//   a call of its own), so it must never be armed sticky.
+// - close is never restarted: Linux releases the descriptor whatever close returns. An
+//   injected close failure releases it too, as the kernel would.
 #pragma once
 
 #include <sys/stat.h>
@@ -58,8 +67,11 @@ int futimes(int fd, const struct timeval times[2]);
 int rename(const char *from, const char *to);
 int mkdir(const char *path, mode_t mode);
 char *realpath(const char *path, char *resolved);
-// malloc for the allocations whose failure the library reports (large buffers).
+// The allocations whose failure the library reports. realloc and strdup count as Malloc calls;
+// a failed realloc leaves the old block as it was.
 void *malloc(size_t size);
+void *realloc(void *block, size_t size);
+char *strdup(const char *text);
 void *calloc(size_t count, size_t size);
 int dup(int fd);
 off_t lseek(int fd, off_t offset, int whence);

@@ -54,7 +54,10 @@ int tryCompressor(CompressorContext *ctx, int entry, FileHandle *fh, const char 
 
 // Everything after the handle is open; the caller closes it.
 int compressOpenFile(CompressorContext *ctx, const char *path, FileHandle *fh, PVMutableDictionaryRef dictionary) {
-  if (fh->getxattr(fh, kResourceForkXattrName, nullptr, 0, 0, 0) > 0) return -1;  // keeps its own fork
+  // A file with a resource fork of its own keeps it; so does one whose fork cannot be sized,
+  // since the compressors would write over it.
+  int64_t forkSize = fh->getxattr(fh, kResourceForkXattrName, nullptr, 0, 0, 0);
+  if (forkSize > 0 || (forkSize < 0 && errno != ENOATTR)) return -1;
   struct timespec times[2] = {};
   if (fh->times(fh, times) == -1) return -1;
   int64_t size = fh->size(fh);
@@ -127,17 +130,27 @@ int checksumFile(const char *path, uint8_t digest[16]) {
   int fd = sys::open(path, O_RDONLY, 0);
   if (fd < 0) return 0;
   platform::Stat st;
-  if (platform::fstat(fd, &st) == 0 && (st.st_flags & kCompressedFlag) && !osSupportsDecmpfs()) {
+  if (platform::fstat(fd, &st) != 0) {
+    // Without the flags it is unknown where the data lives.
+    PLZC_ERR("%s:%d: fstat %s: %s\n", path, strerror(errno));
+    sys::close(fd);
+    return 0;
+  }
+  if ((st.st_flags & kCompressedFlag) && !osSupportsDecmpfs()) {
     // The data fork of a compressed file is empty here: digest what every reader is given.
     sys::close(fd);
     FileHandle *fh = openFile(path, path, O_RDONLY);
     if (!fh) return 0;
-    decompressData(fh, md5Writer, &md5);
+    // Data that cannot be decompressed has no digest (decompressData said why).
+    int decompressed = decompressData(fh, md5Writer, &md5);
     fh->close(fh);
+    if (decompressed != 0) return 0;
   } else {
     uint8_t block[4096];
     ssize_t got;
     while ((got = sys::read(fd, block, sizeof block)) > 0) MD5Update(&md5, block, static_cast<size_t>(got));
+    // The digest covers what was read; say why it ends early, as it will not match.
+    if (got < 0) PLZC_ERR("%s:%d: read %s: %s\n", path, strerror(errno));
     sys::close(fd);
   }
   MD5Final(digest, &md5);

@@ -7,7 +7,9 @@
 
 // MD5 of the file's logical data: the data fork of a plain file, the decompressed data of a
 // compressed one (the Linux kernel does not decompress, so the library reads it). 1 with the
-// 16-byte digest, 0 when the file cannot be opened (silently).
+// 16-byte digest, 0 when the file cannot be opened (silently), its flags cannot be read or its
+// compressed data cannot be decompressed (both reported). A read error of a plain file is
+// reported and ends the digest early, which is still returned.
 int checksumFile(const char *path, uint8_t digest[16]);
 
 // Receives the logical data in order, in pieces of at most 128 KiB: -1 stops with failure.

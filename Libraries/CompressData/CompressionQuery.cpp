@@ -11,6 +11,7 @@
 #include "Libraries/CompressData/DiskHeader.h"
 #include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
+#include "Platform/Syscalls.h"
 #include "Platform/VolumeCapabilities.h"
 #include "Plenzo.h"
 
@@ -36,7 +37,7 @@ int queryCompressionInfo(const char *path, CompressionInfo *info) {
     PLZC_ERR("%s:%d: Error: Could not get decmpfs xattr for path %s; %s (%d)\n", path, strerror(errno), errno);
     return -1;
   }
-  auto *attribute = static_cast<uint8_t *>(malloc(attributeSize > 0 ? static_cast<size_t>(attributeSize) : 1));
+  auto *attribute = static_cast<uint8_t *>(sys::malloc(attributeSize > 0 ? static_cast<size_t>(attributeSize) : 1));
   if (!attribute) return -1;
   ssize_t got = platform::getxattr(path, kDecmpfsXattrName, attribute, static_cast<size_t>(attributeSize), 0,
                                    kShowCompressionOption);

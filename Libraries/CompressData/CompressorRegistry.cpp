@@ -43,7 +43,7 @@ static int firstMissingOperation(const CompressorOps &row) {
 // Parses the comma-separated list into the context's entries; false when any token is bad
 // (every token is examined and each bad one reported).
 static bool parseCompressorList(CompressorContext *ctx, const char *compressorList) {
-  char *copy = strdup(compressorList);
+  char *copy = sys::strdup(compressorList);
   if (!copy) return true;  // no compressors: every file counts as not compressed
   bool ok = true;
   char *cursor = copy;
@@ -76,13 +76,13 @@ static bool parseCompressorList(CompressorContext *ctx, const char *compressorLi
 
 CompressorContext *initCompressor(const char *compressorList, void *initArg1, void *initArg2, const char *tocPath,
                                   bool verifyChecksums, int32_t compressionLevel, bool allowLargeResourceForks) {
-  auto *ctx = static_cast<CompressorContext *>(calloc(1, sizeof(CompressorContext)));
+  auto *ctx = static_cast<CompressorContext *>(sys::calloc(1, sizeof(CompressorContext)));
   if (!ctx) return nullptr;
   pthread_mutex_init(&ctx->tocLock, nullptr);
   ctx->verifyChecksums = verifyChecksums;
   ctx->tocFd = -1;
   if (tocPath) {
-    char *copy = strdup(tocPath);
+    char *copy = sys::strdup(tocPath);
     if (!copy || mkdirRecursive(dirname(copy)) != 0) {
       PLZC_ERR("%s:%d: mkdirRecursive %s: %s\n", tocPath, strerror(errno));
       free(copy);
@@ -109,8 +109,8 @@ CompressorContext *initCompressor(const char *compressorList, void *initArg1, vo
     freeCompressor(ctx);
     return nullptr;
   }
-  ctx->compressorContexts = static_cast<void **>(calloc(ctx->compressorCount ? ctx->compressorCount : 1, sizeof(void *)));
-  ctx->successCounts = static_cast<uint32_t *>(calloc(ctx->compressorCount ? ctx->compressorCount : 1, sizeof(uint32_t)));
+  ctx->compressorContexts = static_cast<void **>(sys::calloc(ctx->compressorCount ? ctx->compressorCount : 1, sizeof(void *)));
+  ctx->successCounts = static_cast<uint32_t *>(sys::calloc(ctx->compressorCount ? ctx->compressorCount : 1, sizeof(uint32_t)));
   if (!ctx->compressorContexts || !ctx->successCounts) {
     ctx->compressorCount = 0;
     freeCompressor(ctx);

@@ -43,7 +43,7 @@ struct FileEnumerator {
 namespace {
 
 FileEnumerator *newEnumerator() {
-  auto *enumerator = static_cast<FileEnumerator *>(calloc(1, sizeof(FileEnumerator)));
+  auto *enumerator = static_cast<FileEnumerator *>(sys::calloc(1, sizeof(FileEnumerator)));
   if (!enumerator) return nullptr;
   enumerator->visited = PVDictionaryCreateMutable(0, kPVDictionaryPlainValues);
   if (!enumerator->visited) {
@@ -72,7 +72,7 @@ int compressorVisitFile(FileEnumerator *enumerator, uint64_t inode, const char *
     fflush(stdout);
     result = 0;
   } else {
-    char *copy = strdup(path);
+    char *copy = sys::strdup(path);
     if (copy && !PVDictionarySetValue(enumerator->visited, key, copy)) free(copy);
     result = 1;
   }
@@ -122,7 +122,7 @@ void freeFileEnumeratorFromDir(FileEnumerator *enumerator) {
 
 FileEnumerator *initFileEnumeratorFromFileList(const char *listPath, const char *prefix) {
   FileEnumerator *enumerator = newEnumerator();
-  auto *state = static_cast<FileListState *>(calloc(1, sizeof(FileListState)));
+  auto *state = static_cast<FileListState *>(sys::calloc(1, sizeof(FileListState)));
   if (!enumerator || !state) {
     if (enumerator) releaseVisited(enumerator);
     free(enumerator);
@@ -159,7 +159,7 @@ FileEnumerator *initFileEnumeratorFromFileList(const char *listPath, const char 
   }
   state->listSize = static_cast<int32_t>(st.st_size);
   if (prefix) {
-    state->prefix = strdup(prefix);
+    state->prefix = sys::strdup(prefix);
     size_t length = state->prefix ? strlen(state->prefix) : 0;
     if (length > 0 && state->prefix[length - 1] == '/') state->prefix[length - 1] = '\0';
   }

@@ -301,6 +301,63 @@ TEST_F(OverlayFile, ApplyingIsAllOrNothing) {
 
 // A type-4 attempt that fails part-way through a read-once pool gives back what it consumed,
 // so that the plain write-out still reads the whole file from the start.
+TEST_F(OverlayFile, DetachedOverlayOutlivesItsBase) {
+  ASSERT_EQ(overlay->setxattr(overlay, kHeader, "fpmc", 4, 0, 0), 0);
+  ASSERT_EQ(overlayDetachBase(overlay), 0);
+  EXPECT_STREQ(overlay->name, "pool");
+  EXPECT_NE(overlay->name, source.handle.name) << "the name must be the overlay's own copy";
+  EXPECT_EQ(overlay->path, overlay->name);
+  char header[4];
+  EXPECT_EQ(overlay->getxattr(overlay, kHeader, header, sizeof header, 0, 0), 4);
+  EXPECT_EQ(overlay->getxattr(overlay, kFork, nullptr, 0, 0, 0), -1);
+  EXPECT_EQ(errno, ENOATTR);
+  uint8_t byte;
+  EXPECT_EQ(overlay->pread(overlay, &byte, 1, 0), -1);
+  EXPECT_EQ(errno, EBADF);
+  EXPECT_EQ(overlay->size(overlay), -1);
+  EXPECT_EQ(source.position, 0);  // the base was never asked
+}
+
+// A type-4 attempt that fails in its last step, after it had read the whole file from a
+// read-once base, still gives every byte back: here the size query of the finished fork cannot
+// allocate.
+TEST(OverlayGiveBack, LateFailureAfterTheWholeFileWasReadGivesEveryByteBack) {
+  std::vector<uint8_t> file = compressibleBytes(5 * 65536 + 99, 3);
+  // Returns the allocations the attempt made; a non-zero `fail` makes that one fail.
+  auto attempt = [&](uint64_t fail) {
+    DataPool *pool = newDataPool(static_cast<int64_t>(file.size()));
+    EXPECT_EQ(addDataToPool(pool, file.data(), file.size()), static_cast<int64_t>(file.size()));
+    finishDataPool(pool);
+    FileHandle *poolFile = openDataPoolFile(pool, "pool");
+    PVMutableDictionaryRef dict = PVDictionaryCreateMutable(0, kPVDictionaryRetainedValues);
+    FileHandle *overlay = openTocFile(poolFile, dict, 1);
+    void *context = initCompressorType4(nullptr, nullptr, 5, 0);
+    uint64_t before = sys::callCount(sys::Call::Malloc);
+    if (fail) sys::armFault(sys::Call::Malloc, fail, ENOMEM);
+    EXPECT_EQ(compressFileType4(overlay, "pool", static_cast<int64_t>(file.size()), context), fail ? -1 : 0);
+    sys::clearFaults();
+    uint64_t made = sys::callCount(sys::Call::Malloc) - before;
+    freeContextType4(context);
+    if (fail) {
+      std::vector<uint8_t> back(file.size());
+      int64_t got = 0;
+      for (int64_t n; got < static_cast<int64_t>(back.size()) &&
+                      (n = overlay->pread(overlay, back.data() + got, 100000, got)) > 0;)
+        got += n;
+      EXPECT_EQ(got, static_cast<int64_t>(file.size()));
+      EXPECT_TRUE(back == file);
+    }
+    overlay->close(overlay);
+    poolFile->close(poolFile);
+    PVRelease(dict);
+    releaseDataPool(pool);
+    return made;
+  };
+  uint64_t allocations = attempt(0);
+  ASSERT_GT(allocations, 0u);
+  attempt(allocations);  // the last one: the key of the fork's size query
+}
+
 TEST(OverlayGiveBack, FailedAttemptOnAPoolLeavesEveryByteForTheNextReader) {
   // Compressible chunks first (if any), then random ones that blow the fork's budget: at
   // chunk 0 for the small file, at a later chunk for the others.

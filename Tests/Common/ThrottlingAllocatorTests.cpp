@@ -1,5 +1,6 @@
 #include "Common/ThrottlingAllocator.h"
 
+#include <fcntl.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -14,6 +15,7 @@
 #include <thread>
 
 #include "Platform/SystemResources.h"
+#include "Platform/Syscalls.h"
 #include "Support/TestSupport.h"
 
 using namespace plzctest;
@@ -212,6 +214,34 @@ TEST(ThrottlingAllocator, OpenFailureIsReportedAndLeavesTheCountAlone) {
   EXPECT_EQ(closeAndSignal(0), 0);
   EXPECT_EQ(closeAndSignal(-1), 0);
   EXPECT_EQ(throttlingDescriptorsHeld(), 0);
+}
+
+// Linux releases a descriptor whatever close returns; the budget must get its place back too,
+// or every failed close would shrink it for good.
+TEST(ThrottlingAllocator, AFailedCloseStillGivesTheDescriptorBack) {
+  int fd = waitThenDupOrOpen("/dev/null", -1);
+  ASSERT_GE(fd, 0);
+  EXPECT_EQ(throttlingDescriptorsHeld(), 1);
+  sys::armFault(sys::Call::Close, 1, EIO);
+  EXPECT_EQ(closeAndSignal(fd), -1);
+  EXPECT_EQ(errno, EIO);
+  sys::clearFaults();
+  EXPECT_EQ(throttlingDescriptorsHeld(), 0);
+  EXPECT_EQ(fcntl(fd, F_GETFD), -1) << "the descriptor is still open";
+}
+
+// Opening a FIFO or a device can be interrupted; the wrapper restarts it, so a waiting opener
+// neither fails nor reports anything.
+TEST(ThrottlingAllocator, InterruptedOpenIsRestarted) {
+  uint64_t opens = sys::callCount(sys::Call::Open);
+  sys::armFault(sys::Call::Open, 1, EINTR);
+  testing::internal::CaptureStderr();
+  int fd = waitThenDupOrOpen("/dev/null", -1);
+  EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
+  sys::clearFaults();
+  EXPECT_GE(fd, 0);
+  EXPECT_EQ(sys::callCount(sys::Call::Open), opens + 2);  // the interrupted call and its restart
+  EXPECT_EQ(closeAndSignal(fd), 0);
 }
 
 TEST(SystemResources, CgroupLimitLowersPhysicalMemory) {

@@ -250,6 +250,35 @@ TEST_F(ExtendedAttributes, FailedReplacementKeepsThePreviousValue) {
   }
 }
 
+// A value that grows out of one Linux attribute is published by writing its index and then
+// removing its plain form, which readers take first: while the plain form stays, the write has
+// not happened, and the new segments must go again.
+TEST_F(ExtendedAttributes, GrowingPastOneAttributeFailsWholeWhenThePlainFormStays) {
+  std::vector<uint8_t> small = randomBytes(1000, 21), more = randomBytes(2 * kPiece, 22);
+  ASSERT_EQ(platform::setxattr(path.c_str(), kFork, small.data(), small.size(), 0, 0), 0);
+  std::vector<std::string> namesBefore = linuxAttributeNames(path);
+  sys::armFault(sys::Call::Removexattr, 1, EIO);
+  EXPECT_EQ(platform::setxattr(path.c_str(), kFork, more.data(), more.size(), static_cast<uint32_t>(small.size()), 0),
+            -1);
+  EXPECT_EQ(errno, EIO);
+  sys::clearFaults();
+  EXPECT_EQ(readAll(kFork), small);
+  EXPECT_EQ(linuxAttributeNames(path), namesBefore);
+}
+
+// An index that cannot be read says nothing about the value: a write must fail rather than
+// take it for a damaged record and start the value afresh.
+TEST_F(ExtendedAttributes, WriteFailsWhenTheIndexCannotBeRead) {
+  std::vector<uint8_t> model = randomBytes(3 * kPiece, 23);
+  ASSERT_EQ(platform::setxattr(path.c_str(), kFork, model.data(), model.size(), 0, 0), 0);
+  // The write asks for the plain form (missing), then for the index: fail that one.
+  sys::armFault(sys::Call::Getxattr, 2, EIO);
+  EXPECT_EQ(platform::setxattr(path.c_str(), kFork, "x", 1, 10, 0), -1);
+  EXPECT_EQ(errno, EIO);
+  sys::clearFaults();
+  EXPECT_EQ(readAll(kFork), model);
+}
+
 TEST_F(ExtendedAttributes, ReaderSeesOldOrNewValueNeverAMix) {
   std::vector<uint8_t> a(5 * kPiece, 'a'), b(5 * kPiece + 10, 'b');
   ASSERT_EQ(platform::setxattr(path.c_str(), "value", a.data(), a.size(), 0, 0), 0);

@@ -10,6 +10,7 @@
 #include "Compressors/Zlib/ByteOrder.h"
 #include "Compressors/Zlib/Type3/compressorType3.h"
 #include "Libraries/CompressData/DiskHeader.h"
+#include "Platform/Syscalls.h"
 
 static constexpr char kSourcePath[] = "Compressors/Zlib/Type3/compressorType3Imp";
 
@@ -88,7 +89,7 @@ int doCompressType3(Type3State *state, int32_t level) {
 }  // namespace
 
 void *initCompressorType3(void *initArg1, void *initArg2, int32_t compressionLevel, int32_t allowLargeResourceForks) {
-  auto *context = static_cast<Type3Context *>(calloc(1, sizeof(Type3Context)));
+  auto *context = static_cast<Type3Context *>(sys::calloc(1, sizeof(Type3Context)));
   if (context) context->compressionLevel = static_cast<uint32_t>(compressionLevel);
   return context;
 }

@@ -74,6 +74,7 @@ struct Type4State {
   uint32_t chunkCount;
   uint32_t inlineLength;  // length of the header attribute when the type-3 form was written
   uint32_t supplyOffset;  // the engine's prefix for this call
+  bool consumedAll;       // the engine read the whole file and emitted every chunk
 };
 
 int forkReadOptions() { return osSupportsDecmpfs() ? kShowCompressionOption : 0; }
@@ -172,8 +173,11 @@ int64_t usableBlockSize(FileHandle *handle) {
 }
 
 // Compresses the file into the fork and the header attribute; *inlineForm tells whether the
-// type-3 form was written instead. 0, or the engine's result, or -1.
-int doCompressType4(FileHandle *handle, int32_t level, bool allowLargeResourceForks, bool *inlineForm) {
+// type-3 form was written instead. 0, or the engine's result, or -1. The run's state stays in
+// *state: after the engine consumed the whole file (state->consumedAll) its chunks can be
+// read back through it.
+int doCompressType4(FileHandle *handle, int32_t level, bool allowLargeResourceForks, Type4State *out,
+                    bool *inlineForm) {
   *inlineForm = false;
   int64_t size = handle->size(handle);
   if (size < 0) return -1;
@@ -184,7 +188,8 @@ int doCompressType4(FileHandle *handle, int32_t level, bool allowLargeResourceFo
   if (!allowLargeResourceForks && dataLimit > kMaxDataLength) dataLimit = kMaxDataLength;
   dataLimit = std::min(dataLimit, kMaxDataLength32);
 
-  Type4State state = {};
+  Type4State &state = *out;
+  state = {};
   state.handle = handle;
   state.dataStart = kDataStart;
   state.dataLimit = dataLimit;
@@ -193,6 +198,7 @@ int doCompressType4(FileHandle *handle, int32_t level, bool allowLargeResourceFo
   int result = chunkingCompressor(handle, 0, kType4ChunkSize, 0, static_cast<int32_t>(kDiskHeaderSize), 0, &state,
                                   emitBytesType4, supplyChunkType4, level);
   if (result != 0) return result;
+  state.consumedAll = true;
   if (state.inlineLength != 0) {
     *inlineForm = true;
     return 0;
@@ -228,10 +234,21 @@ void removeFork(FileHandle *handle) {
   errno = savedErrno;
 }
 
+// Gives up the file. When the engine had consumed all of it from a read-once source (a data
+// pool behind an overlay), the file is first rebuilt from the fork and given back, so that the
+// plain write-out that follows still gets every byte.
+int refuse(FileHandle *handle, Type4State *state) {
+  if (state->consumedAll)
+    chunkingGiveBackAll(handle, static_cast<int64_t>(state->fileSize), kType4ChunkSize,
+                        static_cast<int32_t>(kDiskHeaderSize), 0, state, supplyChunkType4);
+  removeFork(handle);
+  return -1;
+}
+
 }  // namespace
 
 void *initCompressorType4(void *initArg1, void *initArg2, int32_t compressionLevel, int32_t allowLargeResourceForks) {
-  auto *context = static_cast<Type4Context *>(calloc(1, sizeof(Type4Context)));
+  auto *context = static_cast<Type4Context *>(sys::calloc(1, sizeof(Type4Context)));
   if (context) {
     context->compressionLevel = static_cast<uint32_t>(compressionLevel);
     context->allowLargeResourceForks = allowLargeResourceForks != 0;
@@ -245,18 +262,14 @@ int compressFileType4(FileHandle *handle, const char *path, int64_t size, void *
   auto *context = static_cast<Type4Context *>(opaqueContext);
   if (!context->allowLargeResourceForks && size > kMaxFileSize) return -1;
   bool inlineForm = false;
+  Type4State state = {};
   if (doCompressType4(handle, static_cast<int32_t>(context->compressionLevel), context->allowLargeResourceForks != 0,
-                      &inlineForm) != 0) {
-    removeFork(handle);
-    return -1;
-  }
+                      &state, &inlineForm) != 0)
+    return refuse(handle, &state);
   if (inlineForm) return 0;
 
   int64_t forkSize = handle->getxattr(handle, kResourceForkXattrName, nullptr, 0, 0, 0);
-  if (forkSize < 0) {
-    removeFork(handle);
-    return -1;
-  }
+  if (forkSize < 0) return refuse(handle, &state);
   int64_t blockSize = usableBlockSize(handle);
   int64_t forkBlocks = roundUpBlocks(forkSize, blockSize);
   int64_t fileBlocks = roundUpBlocks(size, blockSize);
@@ -265,8 +278,7 @@ int compressFileType4(FileHandle *handle, const char *path, int64_t size, void *
          static_cast<long long>(size), static_cast<long long>(fileBlocks), static_cast<long long>(forkSize),
          static_cast<long long>(forkBlocks), forkBlocks * 100.0 / static_cast<double>(fileBlocks));
   fflush(stdout);
-  removeFork(handle);
-  return -1;
+  return refuse(handle, &state);
 }
 
 int64_t doUncompressType4(FileHandle *handle, int64_t offset, uint64_t size, uint32_t vectorCount,
