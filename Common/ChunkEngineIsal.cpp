@@ -26,7 +26,9 @@ class IsalChunkEncoder final : public ChunkEncoder {
   explicit IsalChunkEncoder(int level) : level_(isalLevel(level)), storeOnly_(level == 0) {
     if (level_ < 0) return;
     levelBufferSize_ = levelBufferSize(level_);
-    levelBuffer_.reset(new (std::nothrow) uint8_t[levelBufferSize_ ? levelBufferSize_ : 1]);
+    // Zeroed: igzip reads its hash tables before it has written all of them, so a buffer of
+    // leftover bytes would make the same data compress to different streams from run to run.
+    levelBuffer_.reset(new (std::nothrow) uint8_t[levelBufferSize_ ? levelBufferSize_ : 1]());
   }
 
   Result encode(const uint8_t *input, uint32_t count, uint8_t *output, uint32_t space, uint32_t *produced,
