@@ -11,6 +11,7 @@
 #include "Common/FileHandle.h"
 #include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
+#include "Platform/FileIdentity.h"
 #include "Platform/Syscalls.h"
 
 static constexpr char kSourcePath[] = "Common/PlainFile";
@@ -68,12 +69,7 @@ int plainTimes(FileHandle *fh, struct timespec times[2]) {
 }
 
 int plainUtimes(FileHandle *fh, const struct timespec times[2]) {
-  struct timeval micro[2];
-  for (int i = 0; i < 2; i++) {
-    micro[i].tv_sec = times[i].tv_sec;
-    micro[i].tv_usec = times[i].tv_nsec / 1000;
-  }
-  if (sys::futimes(descriptor(fh), micro) != 0) {
+  if (sys::futimens(descriptor(fh), times) != 0) {
     PLZC_ERR("%s:%d: futimes: %s\n", strerror(errno));
     return -1;
   }
@@ -105,39 +101,50 @@ int64_t plainPread(FileHandle *fh, void *buffer, int64_t count, int64_t offset) 
 }
 
 int64_t plainPwrite(FileHandle *fh, const void *buffer, int64_t count, int64_t offset) {
-  ssize_t put = sys::pwrite(descriptor(fh), buffer, static_cast<size_t>(count), offset);
+  ssize_t put = sys::pwriteAll(descriptor(fh), buffer, static_cast<size_t>(count), offset);
   if (put < 0) PLZC_ERR("%s:%d: pwrite: %s\n", strerror(errno));
   return put;
 }
 
-// The flag, truncation and attribute operations act on the path, whatever the descriptor's
-// open mode.
+// The flag word and the attributes are reached through the descriptor: on Linux that works
+// whatever its open mode (both are attributes, checked against the file's permissions), and it
+// always reaches the file that was opened, never one that another process renamed into its
+// place meanwhile.
 int plainChflags(FileHandle *fh, uint32_t flags) {
-  if (platform::chflags(fh->path, flags) != 0) {
+  if (platform::fchflags(descriptor(fh), flags) != 0) {
     PLZC_ERR("%s:%d: chflags: %s\n", strerror(errno));
     return -1;
   }
   return 0;
 }
 
+// Truncation through the descriptor when it is open for writing; a read-only one leaves only
+// the path, which is used once it is seen to still name the opened file (the check and the
+// truncation are two calls: a rename can only slip in between them, not during a compression).
 int plainTruncate(FileHandle *fh, int64_t length) {
-  if (sys::truncate(fh->path, length) != 0) {
-    PLZC_ERR("%s:%d: truncate: %s\n", strerror(errno));
-    return -1;
+  if (sys::ftruncate(descriptor(fh), length) == 0) return 0;
+  if (errno == EINVAL || errno == EBADF) {
+    if (!platform::pathNamesOpenFile(fh->path, descriptor(fh))) {
+      if (errno == ESTALE) PLZC_ERR("%s:%d: Error: %s no longer names the file opened\n", fh->path);
+      PLZC_ERR("%s:%d: truncate: %s\n", strerror(errno));
+      return -1;
+    }
+    if (sys::truncate(fh->path, length) == 0) return 0;
   }
-  return 0;
+  PLZC_ERR("%s:%d: truncate: %s\n", strerror(errno));
+  return -1;
 }
 
 int64_t plainGetxattr(FileHandle *fh, const char *name, void *buffer, uint64_t size, uint32_t position,
                       int options) {
-  ssize_t got = platform::getxattr(fh->path, name, buffer, size, position, options);
+  ssize_t got = platform::fgetxattr(descriptor(fh), name, buffer, size, position, options);
   if (got < 0 && errno != ENOATTR) PLZC_ERR("%s:%d: getxattr: %s\n", strerror(errno));
   return got;
 }
 
 int plainSetxattr(FileHandle *fh, const char *name, const void *buffer, uint64_t size, uint32_t position,
                   int options) {
-  if (platform::setxattr(fh->path, name, buffer, size, position, options) != 0) {
+  if (platform::fsetxattr(descriptor(fh), name, buffer, size, position, options) != 0) {
     PLZC_ERR("%s:%d: fsetxattr: %s\n", strerror(errno));
     return -1;
   }
@@ -145,7 +152,7 @@ int plainSetxattr(FileHandle *fh, const char *name, const void *buffer, uint64_t
 }
 
 int plainRemovexattr(FileHandle *fh, const char *name, int options) {
-  if (platform::removexattr(fh->path, name, options) != 0) {
+  if (platform::fremovexattr(descriptor(fh), name, options) != 0) {
     if (errno != ENOATTR) PLZC_ERR("%s:%d: removexattr(%s,%s): %s\n", fh->path, name, strerror(errno));
     return -1;
   }

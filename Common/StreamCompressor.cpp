@@ -21,6 +21,7 @@
 #include "Libraries/CompressData/DiskHeader.h"
 #include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
+#include "Platform/FileIdentity.h"
 #include "Platform/Syscalls.h"
 #include "Platform/ThrottledIO.h"
 
@@ -127,10 +128,7 @@ void _SCEnqueueWriter(StreamCompressor *stream, int direct) {
 
 int _SCWriteFailed(int64_t offset, const void *bytes, int64_t count, void *context) {
   auto *stream = static_cast<StreamCompressor *>(context);
-  ssize_t written = sys::pwrite(stream->fd, bytes, static_cast<size_t>(count), offset);
-  if (written == count) return 0;
-  if (written >= 0) errno = ENOSPC;  // a regular file takes fewer bytes only when the disk is full
-  return -1;
+  return sys::pwriteAll(stream->fd, bytes, static_cast<size_t>(count), offset) == count ? 0 : -1;
 }
 
 void _SCCompressFile(void *context) {
@@ -149,7 +147,12 @@ void _SCCompressFile(void *context) {
       bool skip = queue->skipMachOTypeMask != 0 &&
                   _ShouldSkipMachOFile(stream->path, stream->prefix, queue->skipMachOTypeMask,
                                        queue->skipMachOOverridePaths, overlay);
+      errno = 0;
       compressed = !skip && compressFile(queue->compressor, overlay->name, overlay) == 0;
+      // Compression writes only into memory: a shortage of it is the one failure here that is
+      // not the file's own outcome. In place the file stays as it was; say which one.
+      if (!compressed && !skip && queue->inPlace && errno == ENOMEM)
+        PLZC_ERR("%s:%d: Error: no memory to compress %s: %s\n", stream->path, strerror(ENOMEM));
     }
   } else {
     PLZC_ERR("%s:%d: Error: cannot read the data of %s: %s\n", stream->path, strerror(ENOMEM));
@@ -215,9 +218,16 @@ bool storeCompressedForm(StreamCompressor *stream) {
   } else if (applyTocDictToFd(stream->fd, stream->tocDict) == 0) {
     if (!queue->inPlace) {
       success = true;
-    } else if (sys::truncate(stream->path, 0) != 0) {
-      recordError(queue, errno);
-      PLZC_ERR("%s:%d: Error: ftruncate failed for %s: %s\n", stream->path, strerror(errno));
+    } else if (!platform::pathNamesOpenFile(stream->path, stream->fd) || sys::truncate(stream->path, 0) != 0) {
+      // The descriptor may be read-only, so the data is cut by path; never that of a file
+      // renamed into its place meanwhile, whose data would be lost. This file keeps its data
+      // and loses the compressed form just stored.
+      int error = errno;
+      recordError(queue, error);
+      PLZC_ERR("%s:%d: Error: ftruncate failed for %s: %s\n", stream->path, strerror(error));
+      platform::fremovexattr(stream->fd, kDecmpfsXattrName, 0);
+      platform::fremovexattr(stream->fd, kResourceForkXattrName, 0);
+      errno = error;
     } else {
       success = true;
     }
@@ -250,7 +260,7 @@ void writePlainData(StreamCompressor *stream) {
   uint8_t buffer[kCopyBufferSize];
   int64_t offset = 0, got;
   while ((got = stream->handle->pread(stream->handle, buffer, kCopyBufferSize, offset)) > 0) {
-    if (sys::write(stream->fd, buffer, static_cast<size_t>(got)) != got) {
+    if (sys::writeAll(stream->fd, buffer, static_cast<size_t>(got)) != got) {
       recordError(queue, errno);
       PLZC_ERR("%s:%d: Error: write failed for %s: %s\n", stream->path, strerror(errno));
       break;
@@ -295,6 +305,14 @@ void _SCWriteFile(void *context) {
     PLZC_ERR("%s:%d: Error: stat failed for %s: %s\n", stream->path, strerror(errno));
     status = {};
     discardData(stream);
+  } else if (queue->inPlace && stream->tocDict &&
+             ((status.st_flags & kCompressedFlag) || status.st.st_size != stream->expectedSize)) {
+    // The file changed since its data was read (written to, or compressed meanwhile by a stream
+    // that reached the same file under another name): the compressed form in hand is stale and
+    // would replace what the file holds now.
+    PLZC_ERR("%s:%d: %s changed while it was being compressed; left as it is\n", stream->path);
+    status = {};
+    discardData(stream);
   } else {
     // Flags such as immutability must not stop the writing; the saved status keeps them.
     if (status.st_flags & ~kCompressedFlag) platform::fchflags(stream->fd, status.st_flags & kCompressedFlag);
@@ -310,9 +328,9 @@ void _SCWriteFile(void *context) {
       writePlainData(stream);
     }
     if (wrote) {
-      struct timeval times[2] = {{status.st.st_atim.tv_sec, status.st.st_atim.tv_nsec / 1000},
-                                 {status.st.st_mtim.tv_sec, status.st.st_mtim.tv_nsec / 1000}};
-      if (sys::futimes(stream->fd, times) != 0) {
+      // To the nanosecond: a file left as it was keeps its times exactly.
+      struct timespec times[2] = {status.st.st_atim, status.st.st_mtim};
+      if (sys::futimens(stream->fd, times) != 0) {
         recordError(queue, errno);
         PLZC_ERR("%s:%d: Error: futimes failed for %s: %s\n", stream->path, strerror(errno));
       }
@@ -445,7 +463,9 @@ void _SQRelease(StreamCompressorQueue *queue) {
   deleteRecord(queue);
 }
 
-int FinishStreamCompressorQueue(StreamCompressorQueue *queue) {
+int FinishStreamCompressorQueue(StreamCompressorQueue *queue) { return _SQFinishWithCounts(queue, nullptr); }
+
+int _SQFinishWithCounts(StreamCompressorQueue *queue, StreamQueueCounts *counts) {
   if (!queue) {
     errno = EINVAL;
     return -1;
@@ -471,11 +491,13 @@ int FinishStreamCompressorQueue(StreamCompressorQueue *queue) {
     error = EINVAL;
     result = -1;
   }
-  if (int recorded = queue->error.load(std::memory_order_relaxed)) {
+  int32_t recorded = queue->error.load(std::memory_order_relaxed);
+  if (recorded) {
     PLZC_ERR("%s:%d: Error: returning errno %d from FinishStreamCompressorQueue\n", recorded);
     error = recorded;
     result = -1;
   }
+  if (counts) *counts = StreamQueueCounts{enqueued, started, completed, recorded};
   queue->finished = 1;
   _SQRelease(queue);
   if (result == -1) errno = error;
@@ -513,6 +535,7 @@ StreamCompressor *CreateStreamCompressor(int fd, const char *path, const char *p
   DataPool *pool = stream && pathCopy && (!prefix || prefixCopy) ? newDataPool(expectedSize) : nullptr;
   if (!pool) {
     // Out of memory: nothing was submitted, give everything back.
+    PLZC_ERR("%s:%d: Error: no memory to carry the data of %s: %s\n", path, strerror(ENOMEM));
     deleteRecord(stream);
     free(pathCopy);
     free(prefixCopy);
@@ -522,10 +545,12 @@ StreamCompressor *CreateStreamCompressor(int fd, const char *path, const char *p
     return nullptr;
   }
   stream->fd = duplicate;
+  stream->expectedSize = expectedSize;
   stream->path = pathCopy;
   stream->prefix = prefixCopy;
   stream->pool = pool;
   if (!compress && !(stream->handle = _SCHandleForPool(stream))) {
+    PLZC_ERR("%s:%d: Error: no memory to carry the data of %s: %s\n", path, strerror(ENOMEM));
     releaseDataPool(pool);
     free(pathCopy);
     free(prefixCopy);

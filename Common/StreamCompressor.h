@@ -50,6 +50,7 @@ struct StreamCompressor {
   char *path = nullptr;
   char *prefix = nullptr;
   int32_t fd = -1;  // own duplicate of the caller's descriptor, charged to the budget
+  int64_t expectedSize = 0;  // the size announced at creation
   StreamCompressorQueue *queue = nullptr;
   DataPool *pool = nullptr;
   FileHandle *poolHandle = nullptr;  // kept by a failed compression for the plain write-out
@@ -64,6 +65,19 @@ void StreamCompressorQueueSetInPlace(StreamCompressorQueue *queue, int inPlace);
 // The queue's serial I/O queue (NULL before the first stream): work run on it synchronously
 // never overlaps the queue's write-outs.
 WorkQueue *StreamCompressorQueueGetIOQueue(StreamCompressorQueue *queue);
+
+// What the finish compared once every item had run: items submitted, begun and ended, and the
+// errno recorded by any stage (0 for none).
+struct StreamQueueCounts {
+  int32_t enqueued = 0;
+  int32_t started = 0;
+  int32_t completed = 0;
+  int32_t error = 0;
+};
+
+// FinishStreamCompressorQueue that also hands back, in *counts (unless NULL), the counters it
+// compared, so that callers can report what the pipeline did.
+int _SQFinishWithCounts(StreamCompressorQueue *queue, StreamQueueCounts *counts);
 
 // Builds rules, compressor context, group and serial queues on the first stream; true when the
 // queue is (or already was) initialised.

@@ -96,6 +96,14 @@ constexpr int kMaxThreadCap = 4096;
 // Items a serial queue runs in one go before it lets other work of its pool have the thread.
 constexpr int kDrainBatch = 16;
 constexpr uint32_t kGlobalIdleTimeoutMs = 5000;
+// Stack of a worker thread. Items need little (64 KiB buffers at most), and the default of
+// RLIMIT_STACK (8 MiB) per thread adds up under an address-space limit; sanitizers, which
+// enlarge every frame, keep the default (0).
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr size_t kWorkerStackBytes = 0;
+#else
+constexpr size_t kWorkerStackBytes = 1 << 20;
+#endif
 
 std::atomic<int32_t> privatePoolCount{0};
 
@@ -127,6 +135,16 @@ class Pool final : public WorkQueue {
     }
     if (idle_ > 0) workAvailable_.notify_one();
     startThreadIfNeededLocked();
+  }
+
+  // Starts the first thread before any work comes, while the process can still afford one. A
+  // pool that later has no thread and cannot make one (no memory for a stack) could never run
+  // what is queued on it; threads within the width never exit, so this one stays.
+  void startFirstThread() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (threads_ > 0) return;
+    if (int result = startThreadLocked())
+      WQ_FATAL("%s:%d: Error: pthread_create failed for %s: %s\n", label.c_str(), strerror(result));
   }
 
   void blockingBegin() {
@@ -217,16 +235,8 @@ class Pool final : public WorkQueue {
   void startThreadIfNeededLocked() {
     if (static_cast<int64_t>(queue_.size()) <= idle_) return;
     if (threads_ - blocked_ >= width_ || threads_ >= cap_) return;
-    threads_++;
-    peak_ = std::max(peak_, threads_);
-    pthread_attr_t attributes;
-    pthread_attr_init(&attributes);
-    pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
-    pthread_t thread;
-    int result = pthread_create(&thread, &attributes, threadMain, this);
-    pthread_attr_destroy(&attributes);
+    int result = startThreadLocked();
     if (result == 0) return;
-    threads_--;
     // With no thread at all nothing queued would ever run; with some, the work waits for them.
     if (threads_ == 0)
       WQ_FATAL("%s:%d: Error: pthread_create failed for %s: %s\n", label.c_str(), strerror(result));
@@ -234,6 +244,21 @@ class Pool final : public WorkQueue {
       reportedStartFailure_ = true;
       PLZC_ERR("%s:%d: Error: pthread_create failed for %s: %s\n", label.c_str(), strerror(result));
     }
+  }
+
+  // Counts and starts one more thread; 0, or the error of pthread_create (nothing counted).
+  int startThreadLocked() {
+    threads_++;
+    peak_ = std::max(peak_, threads_);
+    pthread_attr_t attributes;
+    pthread_attr_init(&attributes);
+    pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED);
+    if (kWorkerStackBytes) pthread_attr_setstacksize(&attributes, kWorkerStackBytes);
+    pthread_t thread;
+    int result = pthread_create(&thread, &attributes, threadMain, this);
+    pthread_attr_destroy(&attributes);
+    if (result != 0) threads_--;
+    return result;
   }
 
   const std::string threadName_;
@@ -419,6 +444,7 @@ Pool *globalPool(size_t index) {
     globalPools[index] = new (std::nothrow)
         Pool(kind.label, kind.threadName, cores, 4 * cores + 8, kGlobalIdleTimeoutMs, true);
     if (!globalPools[index]) WQ_FATAL("%s:%d: Error: out of memory creating %s\n", kind.label);
+    globalPools[index]->startFirstThread();
   });
   return globalPools[index];
 }

@@ -125,6 +125,7 @@ ssize_t llistxattr(const char *path, char *list, size_t size) {
 ssize_t flistxattr(int fd, char *list, size_t size) { PLZC_WRAP(Flistxattr, -1, ::flistxattr(fd, list, size)); }
 
 int futimes(int fd, const struct timeval times[2]) { PLZC_WRAP(Futimes, -1, ::futimes(fd, times)); }
+int futimens(int fd, const struct timespec times[2]) { PLZC_WRAP(Futimes, -1, ::futimens(fd, times)); }
 int rename(const char *from, const char *to) { PLZC_WRAP(Rename, -1, ::rename(from, to)); }
 int mkdir(const char *path, mode_t mode) { PLZC_WRAP(Mkdir, -1, ::mkdir(path, mode)); }
 char *realpath(const char *path, char *resolved) { PLZC_WRAP(Realpath, nullptr, ::realpath(path, resolved)); }
@@ -135,9 +136,42 @@ void *calloc(size_t count, size_t size) { PLZC_WRAP(Calloc, nullptr, ::calloc(co
 int dup(int fd) { PLZC_WRAP(Dup, -1, ::dup(fd)); }
 off_t lseek(int fd, off_t offset, int whence) { PLZC_WRAP(Lseek, -1, ::lseek(fd, offset, whence)); }
 int chmod(const char *path, mode_t mode) { PLZC_WRAP(Chmod, -1, ::chmod(path, mode)); }
+int fchmod(int fd, mode_t mode) { PLZC_WRAP(Chmod, -1, ::fchmod(fd, mode)); }
 int utimes(const char *path, const struct timeval times[2]) { PLZC_WRAP(Utimes, -1, ::utimes(path, times)); }
 
 #undef PLZC_WRAP
 #undef PLZC_WRAP_RESTARTING
+
+namespace {
+
+// Writes through one call (write, or pwrite at an offset that moves along) until done.
+template <typename WriteCall>
+ssize_t writeEvery(const void *buffer, size_t count, WriteCall call) {
+  const char *at = static_cast<const char *>(buffer);
+  size_t done = 0;
+  while (done < count) {
+    ssize_t wrote = call(at + done, count - done, done);
+    if (wrote < 0 && errno == EINTR) continue;
+    if (wrote < 0) return -1;
+    if (wrote == 0) {
+      errno = ENOSPC;
+      return -1;
+    }
+    done += static_cast<size_t>(wrote);
+  }
+  return static_cast<ssize_t>(count);
+}
+
+}  // namespace
+
+ssize_t writeAll(int fd, const void *buffer, size_t count) {
+  return writeEvery(buffer, count, [fd](const void *bytes, size_t left, size_t) { return write(fd, bytes, left); });
+}
+
+ssize_t pwriteAll(int fd, const void *buffer, size_t count, off_t offset) {
+  return writeEvery(buffer, count, [fd, offset](const void *bytes, size_t left, size_t done) {
+    return pwrite(fd, bytes, left, offset + static_cast<off_t>(done));
+  });
+}
 
 }  // namespace sys

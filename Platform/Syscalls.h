@@ -64,6 +64,9 @@ ssize_t llistxattr(const char *path, char *list, size_t size);
 ssize_t flistxattr(int fd, char *list, size_t size);
 
 int futimes(int fd, const struct timeval times[2]);
+// futimes to the nanosecond, so that restoring a file's times leaves them exactly as they were;
+// counted and failed as a futimes call.
+int futimens(int fd, const struct timespec times[2]);
 int rename(const char *from, const char *to);
 int mkdir(const char *path, mode_t mode);
 char *realpath(const char *path, char *resolved);
@@ -76,7 +79,17 @@ void *calloc(size_t count, size_t size);
 int dup(int fd);
 off_t lseek(int fd, off_t offset, int whence);
 int chmod(const char *path, mode_t mode);
+// chmod of an open file; counted and failed as a chmod call.
+int fchmod(int fd, mode_t mode);
 int utimes(const char *path, const struct timeval times[2]);
+
+// write and pwrite of every byte, through the wrappers above: a short write (a volume filling
+// up) or EINTR is continued until all count bytes are written or a call fails, so that the
+// failure carries its own errno rather than a stale one. Returns count, or -1 with the errno of
+// the call that failed (bytes written before it stay written); a call that writes nothing
+// without an error counts as ENOSPC.
+ssize_t writeAll(int fd, const void *buffer, size_t count);
+ssize_t pwriteAll(int fd, const void *buffer, size_t count, off_t offset);
 
 // Fault injection. `armFault(call, nth, error)` makes the nth call of that kind from now on
 // (1 = the next one) fail with `error`; with `sticky`, that call and every later one fail.

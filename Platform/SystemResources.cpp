@@ -59,7 +59,13 @@ int physicalMemory(uint64_t *bytes) {
   }
   uint64_t memory = static_cast<uint64_t>(pages) * static_cast<uint64_t>(pageSize);
   uint64_t limit = cgroupMemoryLimit("/proc/self/cgroup", "/sys/fs/cgroup");
-  *bytes = limit && limit < memory ? limit : memory;
+  if (limit && limit < memory) memory = limit;
+  // An address-space limit bounds what this process can map, whatever the machine has.
+  struct rlimit addressSpace;
+  if (getrlimit(RLIMIT_AS, &addressSpace) == 0 && addressSpace.rlim_cur != RLIM_INFINITY &&
+      addressSpace.rlim_cur < memory)
+    memory = addressSpace.rlim_cur;
+  *bytes = memory;
   return 0;
 }
 

@@ -7,7 +7,8 @@
 namespace platform {
 
 // Bytes of physical memory this process may use: the machine's memory, lowered to the memory
-// limit of the process's cgroup when one is set. 0, or -1 with errno.
+// limit of the process's cgroup and to its address-space limit (RLIMIT_AS) when they are set.
+// 0, or -1 with errno.
 int physicalMemory(uint64_t *bytes);
 
 // The cgroup memory limit in bytes found under cgroupRoot for the cgroup named in

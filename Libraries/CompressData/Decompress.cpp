@@ -132,63 +132,82 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
     }
     restoreMode = true;
   }
-  if (initial.st_flags & ~kCompressedFlag) {
-    if (platform::chflags(path, kCompressedFlag) != 0) {
-      PLZC_ERR("%s:%d: Error: Failed to clear flags of compressed file at path '%s': %s (%d)\n", path,
-               strerror(errno), errno);
-      return -1;
-    }
-    restoreFlags = true;
-  }
-  if (kernelDecompresses && !forceUserSpace) {
-    // Opening a compressed file for writing makes the kernel expand it in place.
-    int fd = sys::open(path, O_WRONLY, 0);
-    if (fd < 0) {
-      PLZC_ERR("%s:%d: Error: Failed to open compressed file at path '%s' for writing: %s (%d)\n", path,
-               strerror(errno), errno);
-      return -1;
-    }
-    sys::close(fd);
-  } else {
-    FileHandle *fh = openFile(path, path, O_RDWR);
+  // In the library, every step after the open goes through the descriptor: flags, attributes,
+  // times and mode then always reach the file being decompressed, never another file renamed
+  // into its place while it was (which would be left flagged plain with its data elsewhere).
+  FileHandle *fh = nullptr;
+  int fd = -1;
+  auto fail = [&]() {
+    if (fh) fh->close(fh);
+    return -1;
+  };
+  if (!kernelDecompresses || forceUserSpace) {
+    fh = openFile(path, path, O_RDWR);
     if (!fh) {
       PLZC_ERR("%s:%d: Error: Failed to open compressed file at path '%s' for writing: %s (%d)\n", path,
                strerror(errno), errno);
       return -1;
     }
+    fd = *static_cast<int32_t *>(fh->priv);
+    struct stat opened;
+    if (sys::fstat(fd, &opened) != 0 || opened.st_dev != initial.st.st_dev || opened.st_ino != initial.st.st_ino) {
+      if (errno != EIO) errno = ESTALE;
+      PLZC_ERR("%s:%d: Error: File '%s' was replaced while being decompressed: %s (%d)\n", path, strerror(errno),
+               errno);
+      return fail();
+    }
+  }
+  if (initial.st_flags & ~kCompressedFlag) {
+    if ((fh ? fh->chflags(fh, kCompressedFlag) : platform::chflags(path, kCompressedFlag)) != 0) {
+      PLZC_ERR("%s:%d: Error: Failed to clear flags of compressed file at path '%s': %s (%d)\n", path,
+               strerror(errno), errno);
+      return fail();
+    }
+    restoreFlags = true;
+  }
+  if (!fh) {
+    // Opening a compressed file for writing makes the kernel expand it in place.
+    int kernelFd = sys::open(path, O_WRONLY, 0);
+    if (kernelFd < 0) {
+      PLZC_ERR("%s:%d: Error: Failed to open compressed file at path '%s' for writing: %s (%d)\n", path,
+               strerror(errno), errno);
+      return -1;
+    }
+    sys::close(kernelFd);
+  } else {
     if (decompressData(fh, _decompressWriter, fh) == -1) {
       PLZC_ERR("%s:%d: Error: Failed to decompress data for file at path '%s': %s (%d)\n", path, strerror(errno),
                errno);
-      fh->close(fh);
-      return -1;
+      return fail();
     }
     for (const char *name : {kDecmpfsXattrName, kResourceForkXattrName}) {
       if (fh->removexattr(fh, name, 0) == -1 && !(name == kResourceForkXattrName && errno == ENOATTR)) {
         PLZC_ERR("%s:%d: Error: Failed to remove %s xattr of file at path '%s': %s (%d)\n", name, path,
                  strerror(errno), errno);
-        fh->close(fh);
-        return -1;
+        return fail();
       }
     }
-    fh->close(fh);
     restoreFlags = true;
   }
-  struct timeval times[2] = {toTimeval(initial.st.st_atim), toTimeval(initial.st.st_mtim)};
-  if (sys::utimes(path, times) != 0) {
+  struct timespec times[2] = {initial.st.st_atim, initial.st.st_mtim};
+  struct timeval microTimes[2] = {toTimeval(initial.st.st_atim), toTimeval(initial.st.st_mtim)};
+  if ((fh ? sys::futimens(fd, times) : sys::utimes(path, microTimes)) != 0) {
     PLZC_ERR("%s:%d: Error: Failed to restore timestamp of file at path '%s': %s (%d)\n", path, strerror(errno),
              errno);
-    return -1;
+    return fail();
   }
-  if (restoreFlags && platform::chflags(path, initial.st_flags & ~kCompressedFlag) != 0) {
+  uint32_t flags = initial.st_flags & ~kCompressedFlag;
+  if (restoreFlags && (fh ? fh->chflags(fh, flags) : platform::chflags(path, flags)) != 0) {
     PLZC_ERR("%s:%d: Error: Failed to set flags of compressed file at path '%s': %s (%d)\n", path, strerror(errno),
              errno);
-    return -1;
+    return fail();
   }
-  if (restoreMode && sys::chmod(path, mode & 07777) != 0) {
+  if (restoreMode && (fh ? sys::fchmod(fd, mode & 07777) : sys::chmod(path, mode & 07777)) != 0) {
     PLZC_ERR("%s:%d: Error: Failed to restore mode of compressed file at path '%s': %s (%d)\n", path,
              strerror(errno), errno);
-    return -1;
+    return fail();
   }
+  if (fh) fh->close(fh);
   platform::Stat now;
   if (platform::stat(path, &now) != 0) {
     PLZC_ERR("%s:%d: Error: !? Stat failed for path '%s' after file should have decompressed. %s (%d)\n", path,

@@ -102,8 +102,15 @@ FileEnumerator *initFileEnumeratorFromDir(const char *path) {
 }
 
 int enumFilesFromDir(FileEnumerator *enumerator, const char **pathOut) {
+  return enumFilesFromDirReporting(enumerator, pathOut, nullptr, nullptr);
+}
+
+int enumFilesFromDirReporting(FileEnumerator *enumerator, const char **pathOut, EnumProblemHandler problem,
+                              void *context) {
   auto *walk = static_cast<FTS *>(enumerator->walker);
   while (FTSENT *entry = fts_read(walk)) {
+    bool unreadable = entry->fts_info == FTS_DNR || entry->fts_info == FTS_ERR || entry->fts_info == FTS_NS;
+    if (unreadable && problem) problem(entry->fts_path, entry->fts_errno, context);
     if (entry->fts_info != FTS_F) continue;
     if (entry->fts_statp->st_nlink >= 2 && !compressorVisitFile(enumerator, entry->fts_statp->st_ino, entry->fts_path))
       continue;

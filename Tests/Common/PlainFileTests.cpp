@@ -13,6 +13,7 @@
 #include "Support/TestSupport.h"
 
 using namespace plzctest;
+using ::testing::HasSubstr;
 using ::testing::MatchesRegex;
 using ::testing::internal::CaptureStderr;
 using ::testing::internal::GetCapturedStderr;
@@ -70,16 +71,16 @@ TEST_F(PlainFile, ReadsAndWritesArePositional) {
   EXPECT_EQ(fh->size(fh), 14);
 }
 
-TEST_F(PlainFile, TimesRoundTripToTheMicrosecond) {
+TEST_F(PlainFile, TimesRoundTripToTheNanosecond) {
   ASSERT_NE(open(O_RDWR), nullptr);
   struct timespec set[2] = {{1000, 1999999}, {2000, 5}};
   ASSERT_EQ(fh->utimes(fh, set), 0);
   struct timespec got[2];
   ASSERT_EQ(fh->times(fh, got), 0);
   EXPECT_EQ(got[0].tv_sec, 1000);
-  EXPECT_EQ(got[0].tv_nsec, 1999000);
+  EXPECT_EQ(got[0].tv_nsec, 1999999);
   EXPECT_EQ(got[1].tv_sec, 2000);
-  EXPECT_EQ(got[1].tv_nsec, 0);
+  EXPECT_EQ(got[1].tv_nsec, 5);
 }
 
 TEST_F(PlainFile, PathOperationsWorkOnAReadOnlyHandle) {
@@ -128,10 +129,10 @@ TEST_F(PlainFile, EveryFailingOperationPrintsItsMessage) {
       {sys::Call::Fstat, EIO, [&] { return fh->blockSize(fh); }, 4096, "stat: Input/output error"},
       {sys::Call::Pread, EIO, [&] { return fh->pread(fh, buffer, 4, 0); }, -1, "pread: Input/output error"},
       {sys::Call::Pwrite, ENOSPC, [&] { return fh->pwrite(fh, buffer, 4, 0); }, -1, "pwrite: No space left on device"},
-      {sys::Call::Setxattr, ENOSPC, [&] { return int64_t(fh->chflags(fh, 2)); }, -1, "chflags: No space left on device"},
-      {sys::Call::Truncate, EROFS, [&] { return int64_t(fh->truncate(fh, 0)); }, -1, "truncate: Read-only file system"},
-      {sys::Call::Getxattr, EIO, [&] { return fh->getxattr(fh, "a", nullptr, 0, 0, 0); }, -1, "getxattr: Input/output error"},
-      {sys::Call::Setxattr, ENOSPC, [&] { return int64_t(fh->setxattr(fh, "a", "b", 1, 0, 0)); }, -1,
+      {sys::Call::Fsetxattr, ENOSPC, [&] { return int64_t(fh->chflags(fh, 2)); }, -1, "chflags: No space left on device"},
+      {sys::Call::Ftruncate, EROFS, [&] { return int64_t(fh->truncate(fh, 0)); }, -1, "truncate: Read-only file system"},
+      {sys::Call::Fgetxattr, EIO, [&] { return fh->getxattr(fh, "a", nullptr, 0, 0, 0); }, -1, "getxattr: Input/output error"},
+      {sys::Call::Fsetxattr, ENOSPC, [&] { return int64_t(fh->setxattr(fh, "a", "b", 1, 0, 0)); }, -1,
        "fsetxattr: No space left on device"},
   };
   for (const Case &c : cases) {
@@ -149,7 +150,7 @@ TEST_F(PlainFile, EveryFailingOperationPrintsItsMessage) {
   }
   // removexattr names the path and the attribute.
   ASSERT_EQ(fh->setxattr(fh, "a", "b", 1, 0, 0), 0);
-  sys::armFault(sys::Call::Removexattr, 1, EPERM);
+  sys::armFault(sys::Call::Fremovexattr, 1, EPERM);
   CaptureStderr();
   EXPECT_EQ(fh->removexattr(fh, "a", 0), -1);
   EXPECT_EQ(errno, EPERM);
@@ -182,6 +183,31 @@ TEST_F(PlainFile, BlockSizeAfterTheDescriptorWentBadIs4096AndCloseOfNullIsZero) 
   // Any handle's close slot accepts null.
   ASSERT_NE(open(O_RDONLY), nullptr);
   EXPECT_EQ(fh->close(none), 0);
+}
+
+// Another file renamed into the handle's place (an editor saving, a tree being reorganised)
+// must never take the opened file's flags, attributes or truncation.
+TEST_F(PlainFile, AFileRenamedIntoItsPlaceIsNeverChanged) {
+  ASSERT_NE(open(O_RDONLY), nullptr);
+  std::string other = writeFile(dir.file("other"), std::string("other data"));
+  std::string moved = dir.file("moved");
+  ASSERT_EQ(rename(path.c_str(), moved.c_str()), 0);
+  ASSERT_EQ(rename(other.c_str(), path.c_str()), 0);
+
+  EXPECT_EQ(fh->setxattr(fh, "a", "b", 1, 0, 0), 0);
+  EXPECT_EQ(fh->chflags(fh, kFlagCompressed), 0);
+  CaptureStderr();
+  EXPECT_EQ(fh->truncate(fh, 0), -1);
+  EXPECT_EQ(errno, ESTALE);
+  EXPECT_THAT(GetCapturedStderr(), HasSubstr(path + " no longer names the file opened"));
+
+  // The newcomer is as it was; what was done went to the file opened, now at its new name.
+  EXPECT_EQ(readFile(path), std::vector<uint8_t>({'o', 't', 'h', 'e', 'r', ' ', 'd', 'a', 't', 'a'}));
+  EXPECT_TRUE(linuxAttributeNames(path).empty());
+  platform::Stat st;
+  ASSERT_EQ(platform::stat(moved.c_str(), &st), 0);
+  EXPECT_EQ(st.st_flags, kFlagCompressed);
+  EXPECT_EQ(st.st.st_size, 10);
 }
 
 }  // namespace

@@ -426,4 +426,50 @@ TEST_F(StreamCompressor, InPlaceAttributesThatCannotBeStoredLeaveTheFileAlone) {
   }
 }
 
+// Without memory for a file's data pool no stream is made, and the message says for which file.
+TEST_F(StreamCompressor, StreamWithoutMemoryForItsDataNamesTheFile) {
+  // A queue of its own, with nothing else running: the fault is meant for this pool alone.
+  StreamCompressorQueue *queue = CreateStreamCompressorQueue();
+  std::string path = dir.file("second.txt");
+  int fd = open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC, 0644);
+  ASSERT_GE(fd, 0);
+  sys::armFault(sys::Call::Calloc, 1, ENOMEM);
+  CaptureStderr();
+  ::StreamCompressor *stream = CreateStreamCompressor(fd, path.c_str(), dir.path().c_str(), queue, 50000);
+  int error = errno;
+  std::string printed = GetCapturedStderr();
+  sys::clearFaults();
+  close(fd);
+  if (stream) CloseStreamCompressor(stream);  // the fault went elsewhere: still end cleanly
+  EXPECT_EQ(stream, nullptr);
+  EXPECT_EQ(error, ENOMEM);
+  EXPECT_THAT(printed, HasSubstr("Common/StreamCompressor:"));
+  EXPECT_THAT(printed, HasSubstr("Error: no memory to carry the data of " + path + ": Cannot allocate memory\n"));
+  EXPECT_EQ(FinishStreamCompressorQueue(queue), 0);
+}
+
+// In place, a file written to after its data went into the stream keeps what it holds now: the
+// compressed form of its old data is not stored over it.
+TEST_F(StreamCompressor, InPlaceFileChangedMeanwhileIsLeftAsItIs) {
+  std::vector<uint8_t> text = compressibleBytes(300000, 16);
+  std::string path = writeFile(dir.file("changing.txt"), text);
+  StreamCompressorQueue *queue = CreateStreamCompressorQueue();
+  StreamCompressorQueueSetInPlace(queue, 1);
+  int fd = open(path.c_str(), O_RDONLY);
+  ::StreamCompressor *stream = CreateStreamCompressor(fd, path.c_str(), nullptr, queue, static_cast<int64_t>(text.size()));
+  ASSERT_NE(stream, nullptr);
+  // Someone appends while the stream still waits for its data.
+  std::vector<uint8_t> now = text;
+  now.insert(now.end(), {'m', 'o', 'r', 'e'});
+  writeFile(path, now);
+  ASSERT_EQ(WriteToStreamCompressor(stream, text.data(), text.size()), static_cast<int64_t>(text.size()));
+  CloseStreamCompressor(stream);
+  CaptureStderr();
+  EXPECT_EQ(FinishStreamCompressorQueue(queue), 0);
+  EXPECT_THAT(GetCapturedStderr(), HasSubstr(path + " changed while it was being compressed; left as it is"));
+  close(fd);
+  EXPECT_EQ(flagsOf(path), 0u);
+  EXPECT_EQ(readFile(path), now);
+}
+
 }  // namespace

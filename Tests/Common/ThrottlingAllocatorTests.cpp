@@ -264,4 +264,25 @@ TEST(SystemResources, CgroupLimitLowersPhysicalMemory) {
   EXPECT_GT(memory, 64ull << 20);
 }
 
+// An address-space limit bounds what the process can map: the memory the budget starts from is
+// lowered to it. Checked in a child, whose limit dies with it.
+TEST(SystemResources, AddressSpaceLimitLowersPhysicalMemory) {
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+  GTEST_SKIP() << "sanitizers map more than any limit this test could set";
+#endif
+  uint64_t unlimited = 0;
+  ASSERT_EQ(platform::physicalMemory(&unlimited), 0);
+  uint64_t cap = unlimited / 2;
+  pid_t pid = fork();
+  if (pid == 0) {
+    struct rlimit limit = {cap, RLIM_INFINITY};
+    uint64_t memory = 0;
+    bool ok = setrlimit(RLIMIT_AS, &limit) == 0 && platform::physicalMemory(&memory) == 0 && memory == cap;
+    _exit(ok ? 0 : 1);
+  }
+  int status = -1;
+  ASSERT_EQ(waitpid(pid, &status, 0), pid);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "physicalMemory did not report the limit " << cap;
+}
+
 }  // namespace

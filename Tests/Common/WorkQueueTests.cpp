@@ -576,4 +576,14 @@ TEST(WorkQueue, ReleasedPrivatePoolRunsWhatIsQueuedThenGoesAway) {
   EXPECT_TRUE(eventually([&] { return workQueueCountPrivatePools() == poolsBefore; }, 5000ms));
 }
 
+// A global pool starts its first thread when it is created: one that had none later and could not
+// make one (no memory left for a stack) could never run what is queued on it.
+TEST(WorkQueue, GlobalPoolsHaveAThreadFromTheStart) {
+  for (WorkQueuePriority priority : {kWorkQueuePriorityLow, kWorkQueuePriorityBackground}) {
+    WorkQueueStats stats{};
+    ASSERT_EQ(workQueueGetStats(workQueueGetGlobal(priority), &stats), 0);
+    EXPECT_GE(stats.threads, 1) << priority;
+  }
+}
+
 }  // namespace

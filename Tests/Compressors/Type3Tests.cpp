@@ -139,7 +139,7 @@ TEST_F(Type3, LevelComesFromTheContext) {
 
 TEST_F(Type3, FailedAttributeWriteIsReported) {
   FileHandle *fh = open(Bytes(1000, 'a'));
-  sys::armFault(sys::Call::Setxattr, 1, ENOSPC, true);
+  sys::armFault(sys::Call::Fsetxattr, 1, ENOSPC, true);
   CaptureStderr();
   EXPECT_EQ(compress(fh), -1);
   std::string printed = GetCapturedStderr();

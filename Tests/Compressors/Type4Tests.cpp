@@ -341,15 +341,15 @@ TEST_F(Type4, FailedWritesRemoveTheFork) {
   Bytes data = repeatedBlock(150000, 18);
   FileHandle *fh = open(data);
   // Count a clean run's attribute writes: the header is the last one.
-  uint64_t before = sys::callCount(sys::Call::Setxattr);
+  uint64_t before = sys::callCount(sys::Call::Fsetxattr);
   ASSERT_EQ(compress(fh), 0);
-  uint64_t writes = sys::callCount(sys::Call::Setxattr) - before;
+  uint64_t writes = sys::callCount(sys::Call::Fsetxattr) - before;
   std::string path = fh->path;
   for (auto [failing, message] : {std::pair<uint64_t, std::string>{3, "fh_setxattr: "},
                                   {writes, "fh_setxattr " + path + ": "}}) {
     ASSERT_EQ(fh->removexattr(fh, kResourceForkXattrName, 0), 0);
     fh->removexattr(fh, kDecmpfsXattrName, 0);
-    sys::armFault(sys::Call::Setxattr, failing, ENOSPC);
+    sys::armFault(sys::Call::Fsetxattr, failing, ENOSPC);
     CaptureStderr();
     EXPECT_EQ(compress(fh), -1);
     std::string errors = GetCapturedStderr();

@@ -1,10 +1,13 @@
 // Running the plzc binary as a user would: a subprocess with its standard output and error
-// captured, its exit status (or 128 + signal) reported.
+// captured, its exit status (or 128 + signal), wall time and peak memory reported. Resource
+// limits and a user to run as can be applied in the child before it starts plzc.
 #pragma once
 
 #include <fcntl.h>
+#include <grp.h>
 #include <poll.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -26,19 +29,52 @@ inline std::string plzcBinary() {
 struct Finished {
   int status = -1;  // exit status, or 128 + signal
   std::string out, err;
+  double seconds = 0;     // wall time from start to exit
+  long maxRssKiB = 0;     // peak resident memory of the child
+  bool timedOut = false;  // killed when the time given was up
+};
+
+// What the child changes about itself before it starts plzc.
+struct ChildSetup {
+  struct Limit {
+    int resource;  // RLIMIT_NOFILE, RLIMIT_AS...
+    rlim_t soft;
+    rlim_t hard;   // RLIM_INFINITY keeps the current hard limit
+  };
+  std::vector<Limit> limits;
+  // Run as this user and group (the caller must be root); -1 keeps the caller's.
+  uid_t uid = static_cast<uid_t>(-1);
+  gid_t gid = static_cast<gid_t>(-1);
+  // A child still running after this many seconds is killed (SIGKILL); 0 waits for ever.
+  int timeoutSeconds = 0;
 };
 
 // A running plzc with its standard output and error on pipes.
 class Process {
  public:
-  explicit Process(const std::vector<std::string> &args) {
+  explicit Process(const std::vector<std::string> &args, const ChildSetup &setup = {}) {
     int outPipe[2], errPipe[2];
     if (pipe2(outPipe, O_CLOEXEC) != 0 || pipe2(errPipe, O_CLOEXEC) != 0) return;
+    // Everything the child needs is built before the fork: it may only make system calls.
+    std::vector<char *> arguments = argv(args);
+    std::vector<ChildSetup::Limit> limits = setup.limits;
+    for (ChildSetup::Limit &limit : limits) {
+      struct rlimit current {};
+      getrlimit(limit.resource, &current);
+      if (limit.hard == RLIM_INFINITY) limit.hard = current.rlim_max;
+    }
+    start_ = std::chrono::steady_clock::now();
+    timeoutSeconds_ = setup.timeoutSeconds;
     pid_ = fork();
     if (pid_ == 0) {
       dup2(outPipe[1], 1);
       dup2(errPipe[1], 2);
-      std::vector<char *> arguments = argv(args);
+      for (const ChildSetup::Limit &limit : limits) {
+        struct rlimit value = {limit.soft, limit.hard};
+        if (setrlimit(limit.resource, &value) != 0) _exit(126);
+      }
+      if (setup.gid != static_cast<gid_t>(-1) && (setgroups(0, nullptr) != 0 || setgid(setup.gid) != 0)) _exit(126);
+      if (setup.uid != static_cast<uid_t>(-1) && setuid(setup.uid) != 0) _exit(126);
       execv(arguments[0], arguments.data());
       _exit(127);
     }
@@ -68,11 +104,19 @@ class Process {
 
   Finished wait() {
     while (pump(1000)) {
+      if (timeoutSeconds_ > 0 && !run_.timedOut &&
+          std::chrono::steady_clock::now() - start_ > std::chrono::seconds(timeoutSeconds_)) {
+        run_.timedOut = true;
+        kill(pid_, SIGKILL);
+      }
     }
     int status = 0;
-    waitpid(pid_, &status, 0);
+    struct rusage usage {};
+    wait4(pid_, &status, 0, &usage);
     waited_ = true;
     run_.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    run_.seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start_).count();
+    run_.maxRssKiB = usage.ru_maxrss;
     return run_;
   }
 
@@ -105,11 +149,15 @@ class Process {
   }
 
   pid_t pid_ = -1;
+  std::chrono::steady_clock::time_point start_;
+  int timeoutSeconds_ = 0;
   int outFd_ = -1, errFd_ = -1;
   bool waited_ = false;
   Finished run_;
 };
 
-inline Finished plzc(const std::vector<std::string> &args) { return Process(args).wait(); }
+inline Finished plzc(const std::vector<std::string> &args, const ChildSetup &setup = {}) {
+  return Process(args, setup).wait();
+}
 
 }  // namespace plzctest

@@ -16,6 +16,9 @@
 #include <filesystem>
 #include <fstream>
 #include <random>
+#include <thread>
+
+#include "Plenzo.h"
 
 namespace plzctest {
 
@@ -106,6 +109,34 @@ std::vector<uint8_t> compressibleBytes(size_t count, uint32_t seed) {
   return bytes;
 }
 
+std::string catFileTo(const std::string &path, const std::function<void(const uint8_t *, size_t)> &sink) {
+  int pipeFds[2];
+  if (pipe2(pipeFds, O_CLOEXEC) != 0) return std::string("pipe: ") + strerror(errno);
+  fflush(stdout);
+  int savedOut = fcntl(1, F_DUPFD_CLOEXEC, 3);
+  dup2(pipeFds[1], 1);
+  close(pipeFds[1]);
+  FdCapture errors(2);
+  // catFile writes into the pipe while this thread drains it; putting descriptor 1 back closes
+  // the pipe's last write end, which ends the reading.
+  std::thread writer([&] {
+    catFile(path.c_str(), 0);
+    fflush(stdout);
+    dup2(savedOut, 1);
+    close(savedOut);
+  });
+  std::vector<uint8_t> buffer(1 << 20);
+  for (;;) {
+    ssize_t got = read(pipeFds[0], buffer.data(), buffer.size());
+    if (got < 0 && errno == EINTR) continue;
+    if (got <= 0) break;
+    sink(buffer.data(), static_cast<size_t>(got));
+  }
+  writer.join();
+  close(pipeFds[0]);
+  return errors.text();
+}
+
 std::vector<std::string> linuxAttributeNames(const std::string &path) {
   ssize_t size = llistxattr(path.c_str(), nullptr, 0);
   if (size <= 0) return {};
@@ -179,10 +210,13 @@ TemporaryMount TemporaryMount::ext4WithoutLargeAttributes(const std::string &par
 }
 
 TemporaryMount TemporaryMount::tmpfs(const std::string &parentDir, const std::string &size) {
+  return tmpfsWithOptions(parentDir, "size=" + size);
+}
+
+TemporaryMount TemporaryMount::tmpfsWithOptions(const std::string &parentDir, const std::string &options) {
   TemporaryMount mount;
   mount.mountPoint_ = parentDir + "/tmpfs";
   mkdir(mount.mountPoint_.c_str(), 0755);
-  std::string options = "size=" + size;
   int result = ::mount("tmpfs", mount.mountPoint_.c_str(), "tmpfs", 0, options.c_str());
   EXPECT_EQ(result, 0) << "mount tmpfs on " << mount.mountPoint_ << ": " << strerror(errno);
   mount.mounted_ = result == 0;

@@ -6,6 +6,7 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -37,6 +38,11 @@ std::vector<uint8_t> randomBytes(size_t count, uint32_t seed);
 // Deterministic text lines that deflate shrinks several times over, but not to nothing.
 std::vector<uint8_t> compressibleBytes(size_t count, uint32_t seed);
 
+// Runs the library's catFile on path with its standard output handed, piece by piece, to sink
+// (on the calling thread); returns what catFile printed on standard error, empty when it read
+// the file whole. Files of any size pass without being held in memory.
+std::string catFileTo(const std::string &path, const std::function<void(const uint8_t *bytes, size_t count)> &sink);
+
 // Names of every Linux extended attribute of the file (all namespaces the caller may see).
 std::vector<std::string> linuxAttributeNames(const std::string &path);
 
@@ -66,6 +72,9 @@ class TemporaryMount {
  public:
   static TemporaryMount ext4WithoutLargeAttributes(const std::string &parentDir);
   static TemporaryMount tmpfs(const std::string &parentDir, const std::string &size);
+  // A tmpfs with these mount options ("size=4m,nr_inodes=100": on tmpfs the extended
+  // attributes are charged to the inode space, nr_inodes x 1 KiB, not to size).
+  static TemporaryMount tmpfsWithOptions(const std::string &parentDir, const std::string &options);
   TemporaryMount(TemporaryMount &&other) noexcept;
   ~TemporaryMount();
   const std::string &mountPoint() const { return mountPoint_; }

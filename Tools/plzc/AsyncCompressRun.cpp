@@ -41,9 +41,12 @@ CompressResult runCompressAsync(const CompressOptions &options, const std::vecto
   WalkResult walked = forEachFile(
       paths, WalkOptions{}, options.jobs,
       [&](const WalkedFile &file) {
+        errno = 0;
         if (CompressFile(queue, file.path.c_str(), nullptr) != 1) {
+          int error = errno;
           failed++;
-          report("%s: not handed to the compression queue\n", file.path.c_str());
+          report("%s: not handed to the compression queue%s%s\n", file.path.c_str(), error ? ": " : "",
+                 error ? strerror(error) : "");
         } else {
           std::lock_guard<std::mutex> guard(lock);
           handed.push_back(file.path);

@@ -40,6 +40,13 @@ bool isSystemFailure(int error) {
   }
 }
 
+// The cause of a failure as the user should read it.
+std::string describe(int error) {
+  // The library's operations by path refuse to act on another file renamed into its place.
+  if (error == ESTALE) return "another file took its place while it was being compressed; left as it was";
+  return strerror(error);
+}
+
 class Compression {
  public:
   Compression(const CompressOptions &options, CompressorContext *ctx, Console &console, ProgressMeter &progress)
@@ -84,14 +91,14 @@ class Compression {
     if (!readStoredForm(path, &after)) return fail(path, std::string("unreadable after compression: ") + strerror(errno));
     if (!after.compressed && result != 0 && isSystemFailure(error)) {
       countPlain(size);  // the file stays as it was
-      return fail(path, strerror(error));
+      return fail(path, describe(error));
     }
     if (after.compressed) {
       if (result != 0) {
         // The compressed form was stored but a later step failed: with --verify, the data read
         // back differs, or could not be read back.
         return fail(path, options_.verify ? "compressed, but the data read back differs from the original"
-                                          : "compressed, but a later step failed");
+                                          : "compressed, but a later step failed: " + describe(error));
       }
       totals_.compressed++;
       totals_.countType(after.type);
@@ -116,7 +123,7 @@ class Compression {
     }
     if (isSystemFailure(error)) {
       countPlain(size);
-      return fail(path, strerror(error));
+      return fail(path, describe(error));
     }
     leftPlain(path, size, declineReason(size, ownFork));
   }
@@ -152,7 +159,7 @@ class Compression {
     char line[4096];
     vsnprintf(line, sizeof line, format, args);
     va_end(args);
-    console_.err("%s", line);
+    console_.err("%s", visibleText(line).c_str());
   }
 
   const CompressOptions &options_;

@@ -171,12 +171,32 @@ void Console::relayLoop(int readFd) {
   }
 }
 
+std::string visibleText(const std::string &text) {
+  std::string shown;
+  shown.reserve(text.size());
+  for (size_t i = 0; i < text.size(); i++) {
+    unsigned char c = static_cast<unsigned char>(text[i]);
+    if (c >= 0x20 && c != 0x7f) {
+      shown += static_cast<char>(c);
+    } else if (c == '\n' && i + 1 == text.size()) {
+      shown += '\n';
+    } else if (c == '\n' || c == '\t' || c == '\r') {
+      shown += c == '\n' ? "\\n" : c == '\t' ? "\\t" : "\\r";
+    } else {
+      char escaped[8];
+      snprintf(escaped, sizeof escaped, "\\x%02x", c);
+      shown += escaped;
+    }
+  }
+  return shown;
+}
+
 void report(const char *format, ...) {
   va_list args;
   va_start(args, format);
   std::string text = "plzc: " + vformat(format, args);
   va_end(args);
-  reportText(text);
+  reportText(visibleText(text));
 }
 
 void reportText(const std::string &text) {

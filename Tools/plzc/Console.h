@@ -64,7 +64,12 @@ class Console {
   std::mutex lock_;
 };
 
-// Messages for code that may run with or without a console: "plzc: " + text, on standard error.
+// Text as one line can show it: control characters (a newline inside a file name, say) become
+// \n, \t, \r or \xNN, except a newline that ends the text. Other bytes pass unchanged.
+std::string visibleText(const std::string &text);
+
+// Messages for code that may run with or without a console: "plzc: " + text, on standard error,
+// through visibleText.
 void report(const char *format, ...) __attribute__((format(printf, 1, 2)));
 // The text as it stands, on standard error.
 void reportText(const std::string &text);

@@ -1,5 +1,6 @@
 // plzc decompress and plzc cat: compressed files back into plain files, or their data to
 // standard output.
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -12,6 +13,8 @@
 #include "Cli.h"
 #include "Console.h"
 #include "FileWalk.h"
+#include "Libraries/CompressData/DiskHeader.h"
+#include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
 #include "Plenzo.h"
 #include "Progress.h"
@@ -51,6 +54,41 @@ void printDecompressHelp() {
       kEngineHelp, availableProcessors());
 }
 
+// After a failed decompression (a volume that filled up, say) the file still holds its
+// compressed form but may carry part of its data in its data fork, a widened mode and cleared
+// flags: the library leaves what it had done. Puts it back as it was, so that it takes no more
+// room than before and reads as before. Works through a descriptor on the very file examined
+// before, never on another file renamed into its place since. Says what the file was left as.
+std::string putBack(const char *path, const platform::Stat &initial, uint64_t logicalSize) {
+  int fd = open(path, O_RDWR | O_CLOEXEC | O_NOFOLLOW);
+  if (fd < 0) return std::string("left as it is: ") + strerror(errno);
+  auto done = [fd](std::string outcome) {
+    close(fd);
+    return outcome;
+  };
+  platform::Stat now;
+  if (platform::fstat(fd, &now) != 0) return done(std::string("left as it is: ") + strerror(errno));
+  if (now.st.st_dev != initial.st.st_dev || now.st.st_ino != initial.st.st_ino)
+    return done("left as it is: another file took its place meanwhile");
+  if (!(now.st_flags & kFlagCompressed)) {
+    // The failure came after the compressed form was removed: the data fork holds the data.
+    return done(static_cast<uint64_t>(now.st.st_size) == logicalSize ? "left decompressed"
+                                                                       : "left without its compressed form");
+  }
+  if (platform::fgetxattr(fd, kDecmpfsXattrName, nullptr, 0, 0, 0) < static_cast<ssize_t>(sizeof(DiskHeader)))
+    return done("left without its compression header");
+  auto cannot = [&](const char *what) {
+    return done(std::string("not put back as it was: cannot ") + what + ": " + strerror(errno));
+  };
+  if (ftruncate(fd, initial.st.st_size) != 0) return cannot("truncate its data");
+  // The flag word is an attribute that needs write permission: before the mode.
+  if (platform::fchflags(fd, initial.st_flags) != 0) return cannot("restore its flags");
+  timespec times[2] = {initial.st.st_atim, initial.st.st_mtim};
+  if (futimens(fd, times) != 0) return cannot("restore its times");
+  if (fchmod(fd, initial.st.st_mode & 07777) != 0) return cannot("restore its mode");
+  return done("left compressed as it was");
+}
+
 struct DecompressTotals {
   std::atomic<uint64_t> files{0}, decompressed{0}, plain{0}, failed{0}, logicalBytes{0};
 };
@@ -66,13 +104,21 @@ uint64_t decompressOne(const char *path, bool verify, bool userSpace, Console &c
   }
   if (!before.compressed) {
     totals.plain++;
-    if (console.verbose()) console.err("%s: not compressed, left as it is\n", path);
+    if (console.verbose()) console.err("%s: not compressed, left as it is\n", visibleText(path).c_str());
     return before.logicalSize;
+  }
+  platform::Stat initial;
+  if (platform::stat(path, &initial) != 0) {
+    totals.failed++;
+    report("%s: %s\n", path, strerror(errno));
+    return 0;
   }
   errno = 0;
   if (decompressFile(path, verify, userSpace) != 0) {
+    int error = errno;
     totals.failed++;
-    report("%s: cannot decompress%s%s\n", path, errno ? ": " : "", errno ? strerror(errno) : "");
+    std::string outcome = putBack(path, initial, before.logicalSize);
+    report("%s: cannot decompress%s%s; %s\n", path, error ? ": " : "", error ? strerror(error) : "", outcome.c_str());
     return before.logicalSize;
   }
   platform::Stat after;
@@ -86,7 +132,7 @@ uint64_t decompressOne(const char *path, bool verify, bool userSpace, Console &c
   totals.decompressed++;
   totals.logicalBytes += before.logicalSize;
   if (console.verbose())
-    console.err("%s: decompressed (type %u), %llu -> %llu bytes\n", path, before.type,
+    console.err("%s: decompressed (type %u), %llu -> %llu bytes\n", visibleText(path).c_str(), before.type,
                 static_cast<unsigned long long>(before.storedSize),
                 static_cast<unsigned long long>(before.logicalSize));
   return before.logicalSize;

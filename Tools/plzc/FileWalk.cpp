@@ -12,6 +12,7 @@
 
 #include "Cli.h"
 #include "Console.h"
+#include "Libraries/CompressData/FileEnumerator.h"
 #include "Plenzo.h"
 
 namespace plzc {
@@ -100,7 +101,13 @@ class Walker {
       return;
     }
     const char *path = nullptr;
-    while (!interrupted() && enumFilesFromDir(enumerator, &path) == 1) {
+    // Entries the walk cannot read (a directory without permission, a path beyond PATH_MAX)
+    // are failures the user must hear of, not files that silently do not exist.
+    auto problem = [](const char *where, int error, void *context) {
+      report("%s: %s\n", where, strerror(error));
+      static_cast<WalkResult *>(context)->failures++;
+    };
+    while (!interrupted() && enumFilesFromDirReporting(enumerator, &path, problem, &result) == 1) {
       struct stat fileStat;
       if (::lstat(path, &fileStat) != 0) {
         report("%s: %s\n", path, strerror(errno));

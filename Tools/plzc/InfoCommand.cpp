@@ -88,7 +88,7 @@ void printRow(Console &console, const std::string &path, const FileInfo &file) {
     snprintf(ratio, sizeof ratio, "%.3f",
              static_cast<double>(storedSize(file)) / static_cast<double>(file.info.uncompressedSize));
   console.out("%-5s %14llu %14s %7s  %s\n", type.c_str(), static_cast<unsigned long long>(file.info.uncompressedSize),
-              stored.c_str(), ratio, path.c_str());
+              stored.c_str(), ratio, visibleText(path).c_str());
 }
 
 void addTo(Totals &totals, const FileInfo &file) {
@@ -164,7 +164,7 @@ int infoCommand(int argc, char **argv) {
     });
     totals.failed += static_cast<uint64_t>(walked.failures);
     failures += static_cast<int>(totals.failed);
-    console.out("%stree        %s\n%s", anyOutput ? "\n" : "", path.c_str(), formatTotals(totals).c_str());
+    console.out("%stree        %s\n%s", anyOutput ? "\n" : "", visibleText(path).c_str(), formatTotals(totals).c_str());
     anyOutput = true;
     headerShown = false;
   }

@@ -73,7 +73,8 @@ void printHelp() {
       "      --large-forks        also compress files over 64 MiB, into resource forks over 16 MiB\n"
       "  -j, --jobs=N             threads reading sources into the pipeline (default: one per\n"
       "                           processor, here %d)\n"
-      "  -v, --verbose            close with a summary of how the files were stored\n"
+      "  -v, --verbose            close with a summary of how the files were stored and of\n"
+      "                           the pipeline's work items (queued, started, completed)\n"
       "      --no-progress        never draw the progress line (drawn only on a terminal)\n"
       "  -h, --help               show this help and exit\n"
       "\n"
@@ -167,6 +168,10 @@ int installCommand(int argc, char **argv) {
                   static_cast<unsigned long long>(result.hardLinks),
                   static_cast<unsigned long long>(result.plainCopies));
       console.err("%s", formatTotals(result.totals, "  ").c_str());
+      console.err("  pipeline    %lld items queued, %lld started, %lld completed; finish %s\n",
+                  static_cast<long long>(result.itemsQueued), static_cast<long long>(result.itemsStarted),
+                  static_cast<long long>(result.itemsCompleted),
+                  result.queueFailed ? ("failed: " + std::string(strerror(result.queueError))).c_str() : "succeeded");
     }
   }
   PVRelease(options);

@@ -19,6 +19,7 @@
 
 #include "Cli.h"
 #include "Common/FileHandle.h"
+#include "Common/StreamCompressor.h"
 #include "Libraries/CompressData/CompressData.h"
 #include "Libraries/CompressData/DiskHeader.h"
 #include "Platform/ExtendedAttributes.h"
@@ -219,13 +220,14 @@ class Installer {
     }
   }
 
-  // With verbose: how every regular file ended up stored.
+  // With verbose: how every regular file ended up stored; one the pipeline's messages named
+  // counts as failed, whatever it holds.
   Totals storedTotals() {
     Totals totals;
     for (const std::string &path : written_) {
       StoredForm form;
       totals.files++;
-      if (!readStoredForm(path.c_str(), &form)) {
+      if (failedFiles_.count(path) || !readStoredForm(path.c_str(), &form)) {
         totals.failed++;
         continue;
       }
@@ -543,15 +545,20 @@ InstallResult runInstall(const std::vector<std::string> &sources, const std::str
   progress.setTotalFiles(installer.finishWalk());
 
   errno = 0;
-  int finished = FinishStreamCompressorQueue(queue);
+  StreamQueueCounts counts;
+  int finished = _SQFinishWithCounts(queue, &counts);
   int error = errno;
+  result.itemsQueued = counts.enqueued;
+  result.itemsStarted = counts.started;
+  result.itemsCompleted = counts.completed;
   installer.fixDirectories();
   result.seconds = progress.elapsedSeconds();
   tap.stop();
 
   if (finished != 0) {
     result.queueFailed = true;
-    report("the stream queue failed: %s\n", strerror(error ? error : EIO));
+    result.queueError = error ? error : EIO;
+    report("the stream queue failed: %s\n", strerror(result.queueError));
     for (const std::string &path : installer.filesNamedIn(tap.lines())) installer.addFailedFile(path);
   }
   installer.fillResult(&result);

@@ -18,6 +18,10 @@ struct InstallResult {
   double seconds = 0;
   bool setupFailed = false;             // nothing was done (reported)
   bool queueFailed = false;             // the queue's finish failed (reported)
+  int queueError = 0;                   // errno of a failed finish
+  // The pipeline's work items as its finish counted them: submitted, begun and ended. A file
+  // handed to compression is two items (compression, write-out), any other streamed file one.
+  int64_t itemsQueued = 0, itemsStarted = 0, itemsCompleted = 0;
   bool interrupted = false;
   std::vector<std::string> failedFiles; // destination files named in failure messages
 };

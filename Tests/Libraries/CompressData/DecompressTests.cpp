@@ -299,7 +299,7 @@ int decompressReadOnlyFilesAsNobody() {
     }
 
     // Stopped after the data went in: the file was writable while it was written.
-    sys::armFault(sys::Call::Utimes, 1, EPERM);
+    sys::armFault(sys::Call::Futimes, 1, EPERM);
     int result = run(files[1], false, &printed);
     sys::clearFaults();
     if (result != -1) problems << "stopped: result " << result << "\n";
@@ -476,9 +476,10 @@ TEST_F(Decompress, HeaderThatCannotBeReadIsReported) {
     int nth;
     std::string message;
   } cases[] = {
-      // The size query, then the read itself (the plain handle reads attributes by path).
-      {sys::Call::Getxattr, 1, "fh_getxattr\\(" + escaped(path) + ",com\\.tavix\\.decmpfs\\): Input/output error"},
-      {sys::Call::Getxattr, 2, "fh_getxattr\\(" + escaped(path) + ",com\\.tavix\\.decmpfs\\): Input/output error"},
+      // The size query, then the read itself (the plain handle reads attributes through its
+      // descriptor).
+      {sys::Call::Fgetxattr, 1, "fh_getxattr\\(" + escaped(path) + ",com\\.tavix\\.decmpfs\\): Input/output error"},
+      {sys::Call::Fgetxattr, 2, "fh_getxattr\\(" + escaped(path) + ",com\\.tavix\\.decmpfs\\): Input/output error"},
       {sys::Call::Malloc, 1, "waitThenAllocate\\(16\\): Cannot allocate memory"},
       {sys::Call::Malloc, 2, "malloc: Cannot allocate memory"},
   };
@@ -540,9 +541,10 @@ TEST_P(DecompressFileFailure, PrintsTheFailedStepLast) {
   EXPECT_THAT(lastLine(printed), MatchesRegex(kPrefix + "Error: " + message + "\n")) << printed;
 }
 
-// Call counts follow the steps: a flag word is set by path with setxattr and cleared with
-// removexattr, the last removexattr of a run; the handle removes attributes by path too (the
-// header's plain name, its index, then the fork's plain name); stat is called once before and
+// Call counts follow the steps: once the file is open, everything goes through its descriptor:
+// a flag word is set with fsetxattr and cleared with fremovexattr, the last of a run; the
+// header's plain name, its index, then the fork's plain name are removed; times are set with
+// futimens (counted as futimes); stat is called once before and
 // once after, each followed by a getxattr of the flag word; with verify, the last open of a
 // run is the checksum after.
 INSTANTIATE_TEST_SUITE_P(
@@ -550,28 +552,28 @@ INSTANTIATE_TEST_SUITE_P(
     ::testing::Values(
         StepFault{"ChecksumBefore", true, 0, sys::Call::Open, 1, EACCES,
                   "Unable to checksum file '%s' before decompression\\."},
-        StepFault{"ClearFlags", false, kFlagHidden, sys::Call::Setxattr, 1, EPERM,
+        StepFault{"ClearFlags", false, kFlagHidden, sys::Call::Fsetxattr, 1, EPERM,
                   "Failed to clear flags of compressed file at path '%s': Operation not permitted \\(1\\)"},
         StepFault{"OpenForWriting", false, 0, sys::Call::Open, 1, EACCES,
                   "Failed to open compressed file at path '%s' for writing: Permission denied \\(13\\)"},
         StepFault{"WriteData", false, 0, sys::Call::Pwrite, 2, ENOSPC,
                   "Failed to decompress data for file at path '%s': No space left on device \\(28\\)"},
-        StepFault{"RemoveHeader", false, 0, sys::Call::Removexattr, 1, EIO,
+        StepFault{"RemoveHeader", false, 0, sys::Call::Fremovexattr, 1, EIO,
                   "Failed to remove com\\.tavix\\.decmpfs xattr of file at path '%s': Input/output error \\(5\\)"},
-        StepFault{"RemoveFork", false, 0, sys::Call::Removexattr, 3, EIO,
+        StepFault{"RemoveFork", false, 0, sys::Call::Fremovexattr, 3, EIO,
                   "Failed to remove com\\.tavix\\.ResourceFork xattr of file at path '%s': Input/output error "
                   "\\(5\\)"},
-        StepFault{"RestoreTimes", false, 0, sys::Call::Utimes, 1, EPERM,
+        StepFault{"RestoreTimes", false, 0, sys::Call::Futimes, 1, EPERM,
                   "Failed to restore timestamp of file at path '%s': Operation not permitted \\(1\\)"},
-        StepFault{"SetOtherFlags", false, kFlagHidden, sys::Call::Setxattr, 2, EPERM,
+        StepFault{"SetOtherFlags", false, kFlagHidden, sys::Call::Fsetxattr, 2, EPERM,
                   "Failed to set flags of compressed file at path '%s': Operation not permitted \\(1\\)"},
-        StepFault{"ClearLastFlag", false, 0, sys::Call::Removexattr, 0, EPERM,
+        StepFault{"ClearLastFlag", false, 0, sys::Call::Fremovexattr, 0, EPERM,
                   "Failed to set flags of compressed file at path '%s': Operation not permitted \\(1\\)"},
         StepFault{"StatAfter", false, 0, sys::Call::Stat, 2, EIO,
                   "!\\? Stat failed for path '%s' after file should have decompressed\\. Input/output error "
                   "\\(5\\)"},
         // The flag word reported missing while it is there: chflags believes it cleared it.
-        StepFault{"StillCompressed", false, 0, sys::Call::Removexattr, 0, ENODATA,
+        StepFault{"StillCompressed", false, 0, sys::Call::Fremovexattr, 0, ENODATA,
                   "File '%s' was still compressed after attempting decompression\\."},
         // The flag word unreadable at the stat after: it reads as no flags at all.
         StepFault{"ChangedFlags", false, kFlagHidden, sys::Call::Getxattr, 0, EPERM,

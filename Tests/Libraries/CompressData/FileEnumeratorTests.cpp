@@ -1,5 +1,6 @@
 #include "Libraries/CompressData/FileEnumerator.h"
 
+#include <fcntl.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -7,6 +8,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <climits>
 #include <cstdio>
 #include <set>
 #include <string>
@@ -244,6 +246,52 @@ TEST_F(FileEnumerators, OverlongLinesAreRefusedAndTheRestIsRead) {
   walk = walkList(prefixedList, prefix.c_str());
   EXPECT_THAT(walk.paths, ElementsAre(line));
   EXPECT_EQ(walk.err, "");
+}
+
+// A directory whose path is longer than PATH_MAX cannot be read by the walk: the directory
+// enumerator skips it silently, its reporting form names it with the cause.
+TEST_F(FileEnumerators, UnreachableDirectoriesAreReportedToWhoAsks) {
+  std::string root = dir.file("deep");
+  ASSERT_EQ(mkdir(root.c_str(), 0755), 0);
+  writeFile(root + "/top.txt", std::string("top"));
+  int fd = open(root.c_str(), O_RDONLY | O_DIRECTORY);
+  ASSERT_GE(fd, 0);
+  std::string relative;
+  for (int level = 0; level < 20; level++) {
+    std::string name(250, static_cast<char>('a' + level));
+    ASSERT_EQ(mkdirat(fd, name.c_str(), 0755), 0);
+    int next = openat(fd, name.c_str(), O_RDONLY | O_DIRECTORY);
+    close(fd);
+    fd = next;
+    ASSERT_GE(fd, 0);
+    relative += "/" + name;
+  }
+  close(fd);
+
+  struct Problem {
+    std::string path;
+    int error;
+  };
+  for (bool reporting : {false, true}) {
+    std::vector<Problem> problems;
+    std::vector<std::string> files;
+    FileEnumerator *enumerator = initFileEnumeratorFromDir(root.c_str());
+    ASSERT_NE(enumerator, nullptr);
+    const char *path = nullptr;
+    auto handler = [](const char *where, int error, void *context) {
+      static_cast<std::vector<Problem> *>(context)->push_back({where, error});
+    };
+    while ((reporting ? enumFilesFromDirReporting(enumerator, &path, handler, &problems)
+                      : enumFilesFromDir(enumerator, &path)) == 1)
+      files.emplace_back(path);
+    freeFileEnumeratorFromDir(enumerator);
+    EXPECT_THAT(files, ElementsAre(root + "/top.txt"));
+    if (!reporting) continue;
+    ASSERT_EQ(problems.size(), 1u);
+    EXPECT_EQ(problems[0].error, ENAMETOOLONG);
+    EXPECT_GT(problems[0].path.size(), static_cast<size_t>(PATH_MAX));
+    EXPECT_EQ(problems[0].path.compare(0, root.size(), root), 0);
+  }
 }
 
 }  // namespace

@@ -1,0 +1,100 @@
+#!/usr/bin/env bash
+# plzc install against what a user would pick instead, on one corpus in one run: the seeded
+# 256 MiB mixed tree of make_corpus.py (seed 1) on /dev/shm is installed with plzc install,
+# compressed in place with plzc compress -j 2 (a copy), packed with mksquashfs (gzip level 5,
+# 64 KiB blocks, 2 processors), and its 64 KiB chunks deflated at level 5 by raw zlib on one
+# and two threads (the ceiling for zlib-format chunks). Each is run once; prints one table of
+# throughput (MB = 10^6 bytes of logical data per second) and stored/logical ratio, with the
+# ratios of plzc install to mksquashfs and to the 2-thread ceiling.
+#
+# Usage: Benchmarks/installBench.sh [--bench-dir DIR] [--plzc PLZC] [--work DIR]
+#   --bench-dir  the peers' tools (make_corpus.py, zlib_ceiling.c); default ../shared/bench
+#                beside this checkout, or $BENCH_DIR
+#   --plzc       the plzc binary (default: build/Tools/plzc/plzc of this checkout)
+#   --work       where corpus and outputs go (default /dev/shm; must hold compressed files)
+# Not part of CI. Installs squashfs-tools when mksquashfs is missing (as root).
+set -euo pipefail
+
+repo=$(cd "$(dirname "$0")/.." && pwd)
+bench=${BENCH_DIR:-$repo/../shared/bench}
+plzc=$repo/build/Tools/plzc/plzc
+parent=/dev/shm
+while [ $# -gt 0 ]; do
+  case "$1" in
+    --bench-dir) bench=$2; shift 2 ;;
+    --plzc) plzc=$2; shift 2 ;;
+    --work) parent=$2; shift 2 ;;
+    -h|--help) sed -n '2,/^set -e/p' "$0" | sed '$d; s/^# \{0,1\}//'; exit 0 ;;
+    *) echo "installBench: unknown argument '$1' (see --help)" >&2; exit 2 ;;
+  esac
+done
+for f in make_corpus.py zlib_ceiling.c; do
+  [ -f "$bench/$f" ] || { echo "installBench: no $f in $bench (give --bench-dir)" >&2; exit 1; }
+done
+[ -x "$plzc" ] || { echo "installBench: $plzc is not built (cmake --build build --target plzc)" >&2; exit 1; }
+"$plzc" volume "$parent" >/dev/null || { "$plzc" volume "$parent" >&2; exit 1; }
+if ! command -v mksquashfs >/dev/null; then
+  [ "$(id -u)" -eq 0 ] || { echo "installBench: mksquashfs is missing; install squashfs-tools" >&2; exit 1; }
+  DEBIAN_FRONTEND=noninteractive apt-get install -y -qq --no-install-recommends squashfs-tools >/dev/null
+fi
+
+work=$(mktemp -d "$parent/plzc-install-bench.XXXXXX")
+trap 'rm -rf "$work"' EXIT
+corpus=$work/corpus
+python3 "$bench/make_corpus.py" "$corpus" --size-mb 256 --seed 1 >/dev/null
+gcc -O2 -o "$work/zlib_ceiling" "$bench/zlib_ceiling.c" -lz -lpthread
+bytes=$(find "$corpus" -type f -printf '%s\n' | awk '{s += $1} END {print s + 0}')
+files=$(find "$corpus" -type f | wc -l)
+
+# seconds COMMAND...: wall seconds of one run; the command's output goes to $work/last.log.
+seconds() {
+  local start end
+  start=$(date +%s.%N)
+  "$@" >"$work/last.log" 2>&1 || { echo "installBench: failed: $*" >&2; cat "$work/last.log" >&2; exit 1; }
+  end=$(date +%s.%N)
+  awk -v a="$start" -v b="$end" 'BEGIN {printf "%.3f", b - a}'
+}
+# stored TREE: the bytes its files take as plzc counts them (attributes of compressed files,
+# data of plain ones).
+stored() { "$plzc" info -r "$1" | awk '$1 == "stored" {print $2}'; }
+
+sync
+s_install=$(seconds "$plzc" install --no-progress -j 2 "$corpus" "$work/installed")
+o_install=$(stored "$work/installed")
+rm -rf "$work/installed"
+
+cp -a "$corpus" "$work/copy"
+s_compress=$(seconds "$plzc" compress --no-progress -j 2 "$work/copy")
+o_compress=$(stored "$work/copy")
+rm -rf "$work/copy"
+
+s_squash=$(seconds mksquashfs "$corpus" "$work/out.sqsh" -comp gzip -Xcompression-level 5 -b 65536 -processors 2 \
+  -noappend -no-progress)
+o_squash=$(stat -c %s "$work/out.sqsh")
+rm -f "$work/out.sqsh"
+
+# One timed run after zlib_ceiling's own warm-up run.
+"$work/zlib_ceiling" "$corpus" 1 >"$work/ceiling.txt"
+read -r s_ceiling1 o_ceiling < <(awk -F'\t' '/deflate 1T/ {print $2, $3}' "$work/ceiling.txt")
+read -r s_ceiling2 _ < <(awk -F'\t' '/deflate 2T/ {print $2, $3}' "$work/ceiling.txt")
+
+echo "# $(grep -m1 'model name' /proc/cpuinfo | cut -d: -f2 | xargs), $(nproc) cores, $(uname -r), load average $(cut -d' ' -f1-3 /proc/loadavg)"
+echo "# zlib $(dpkg-query -W -f '${Version}' zlib1g 2>/dev/null), $(mksquashfs -version 2>&1 | sed -n 1p), $("$plzc" --version)"
+echo "# corpus: make_corpus.py --size-mb 256 --seed 1: $files files, $bytes bytes; one run each; MB = 10^6 bytes"
+awk -v b="$bytes" \
+    -v si="$s_install" -v oi="$o_install" -v sc="$s_compress" -v oc="$o_compress" \
+    -v sq="$s_squash" -v oq="$o_squash" -v z1="$s_ceiling1" -v z2="$s_ceiling2" -v oz="$o_ceiling" '
+  function row(name, s, o) {
+    printf "%-36s %8.2f %8.1f %7.3f %9.2f %9.2f %9.3f\n", name, s, b / s / 1e6, o / b, sq / s, z2 / s, (o / b) / (oq / b)
+  }
+  BEGIN {
+    printf "%-36s %8s %8s %7s %9s %9s %9s\n", "", "seconds", "MB/s", "ratio", "speed/sq", "speed/z2", "ratio/sq"
+    row("plzc install -j 2", si, oi)
+    row("plzc compress -j 2 (in place)", sc, oc)
+    row("mksquashfs gzip-5 64K -processors 2", sq, oq)
+    row("raw zlib-5 64 KiB chunks, 1 thread", z1, oz)
+    row("raw zlib-5 64 KiB chunks, 2 threads", z2, oz)
+    print ""
+    printf "plzc install: %.2f x the 2-thread zlib ceiling (target at least 0.9), %.2f x mksquashfs (target at least 1),\n", z2 / si, sq / si
+    printf "ratio %.3f against mksquashfs %.3f (target: no worse)\n", oi / b, oq / b
+  }'
