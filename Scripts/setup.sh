@@ -8,6 +8,7 @@ packages=(
   libgtest-dev libgmock-dev libbenchmark-dev     # tests and benchmarks
   zlib1g-dev libmd-dev libplist-dev              # chunk codec, digests, property lists
   attr e2fsprogs util-linux mount                # getfattr, mkfs.ext4, loop mounts in tests
+  clang libclang-rt-14-dev llvm-14               # fuzz targets: libFuzzer, sanitizer runtimes, symbolizer
 )
 
 missing=()

@@ -9,6 +9,8 @@
 #include <string>
 #include <vector>
 
+#include "SampleData.h"
+
 namespace plzctest {
 
 // A fresh directory under $PLZC_TEST_DIR (or /dev/shm), removed with its contents on
@@ -32,10 +34,6 @@ class ScratchDir {
 std::string writeFile(const std::string &path, const std::vector<uint8_t> &bytes);
 std::string writeFile(const std::string &path, const std::string &text);
 std::vector<uint8_t> readFile(const std::string &path);
-// Deterministic pseudo-random bytes.
-std::vector<uint8_t> randomBytes(size_t count, uint32_t seed);
-// Deterministic text lines that deflate shrinks several times over, but not to nothing.
-std::vector<uint8_t> compressibleBytes(size_t count, uint32_t seed);
 
 // Names of every Linux extended attribute of the file (all namespaces the caller may see).
 std::vector<std::string> linuxAttributeNames(const std::string &path);
