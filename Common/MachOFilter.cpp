@@ -2,6 +2,7 @@
 
 #include <pthread.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -27,6 +28,10 @@ namespace {
 
 constexpr size_t kHeaderBytes = 28;
 constexpr uint32_t kMaxArchitectures = 20;
+// The most bytes held in front of a universal file's first slice. Real files put it within the
+// first pages; a header naming an offset further on is not treated as a Mach-O file, rather
+// than holding that much of the file in memory.
+constexpr uint64_t kMaxSlicePrefix = 67108864;
 
 constexpr uint32_t kThin32 = 0xfeedface, kThin64 = 0xfeedfacf;
 constexpr uint32_t kThin32Swapped = 0xcefaedfe, kThin64Swapped = 0xcffaedfe;
@@ -152,14 +157,20 @@ bool _ShouldSkipMachOFile(const char *path, const char *prefix, uint32_t skipMac
     if (magic == kFat || magic == kFatSwapped) {
       bool swapped = magic == kFatSwapped;
       uint32_t architectures = read32(header + 4, swapped), sliceOffset = read32(header + 16, swapped);
-      // Only the first slice is examined; its whole prefix is held so it can be pushed back.
+      // Only the first slice is examined; its whole prefix is held so it can be pushed back. The
+      // buffer stops at the end of the file: a slice placed past it gives a short read, reported
+      // below, without an allocation of the size the header claims.
       uint64_t size = static_cast<uint64_t>(sliceOffset) + kHeaderBytes;
-      if (architectures < kMaxArchitectures && size <= UINT32_MAX &&
-          (prefixBuffer = static_cast<uint8_t *>(sys::malloc(size)))) {
+      int64_t fileSize = fh->size(fh);
+      uint64_t room = fileSize > static_cast<int64_t>(kHeaderBytes)
+                          ? std::min<uint64_t>(size, static_cast<uint64_t>(fileSize))
+                          : kHeaderBytes;
+      if (architectures < kMaxArchitectures && size <= kMaxSlicePrefix &&
+          (prefixBuffer = static_cast<uint8_t *>(sys::malloc(room)))) {
         memcpy(prefixBuffer, header, kHeaderBytes);
         held = prefixBuffer;
-        int64_t rest = fh->pread(fh, prefixBuffer + kHeaderBytes, static_cast<int64_t>(size - kHeaderBytes),
-                                 kHeaderBytes);
+        int64_t rest =
+            fh->pread(fh, prefixBuffer + kHeaderBytes, static_cast<int64_t>(room - kHeaderBytes), kHeaderBytes);
         if (rest != static_cast<int64_t>(size - kHeaderBytes)) {
           PLZC_ERR("%s:%d: read header of '%s': %s\n", path, strerror(errno));
           heldCount = kHeaderBytes + (rest > 0 ? rest : 0);

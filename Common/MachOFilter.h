@@ -22,6 +22,8 @@ int _ComputeMachOTypeMask(uint32_t *skipMachOTypeMask, PVDictionaryRef options);
 PVDictionaryRef createMachOOverridePaths(uint32_t skipMachOTypeMask, PVDictionaryRef options);
 
 // True when the file behind fh (an overlay that can unread) is a Mach-O file of a type in the
-// mask whose path, trimmed of prefix, is not in overridePaths. What was read is pushed back.
+// mask whose path, trimmed of prefix, is not in overridePaths. What was read is pushed back. A
+// universal file whose first slice starts more than 64 MiB in is not taken for a Mach-O file;
+// one whose slice lies past the file's end is reported as a short read.
 bool _ShouldSkipMachOFile(const char *path, const char *prefix, uint32_t skipMachOTypeMask,
                           PVDictionaryRef overridePaths, FileHandle *fh);

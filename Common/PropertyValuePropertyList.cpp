@@ -83,11 +83,12 @@ PVRef convert(plist_t node, int depth) {
       return PVNumberCreateDouble(value);
     }
     case PLIST_STRING: {
-      char *value = nullptr;
-      plist_get_string_val(node, &value);
-      PVRef string = value ? PVStringCreateWithCString(value, kPVStringEncodingUTF8) : nullptr;
-      free(value);
-      return string;
+      // XML cannot carry a NUL character, yet libplist keeps a raw 0 byte of the text inside
+      // the string (and its plist_get_string_val asserts on such strings): refuse the list.
+      uint64_t length = 0;
+      const char *value = plist_get_string_ptr(node, &length);
+      if (!value || strlen(value) != length) return nullptr;
+      return PVStringCreateWithCString(value, kPVStringEncodingUTF8);
     }
     case PLIST_DATA: {
       char *bytes = nullptr;

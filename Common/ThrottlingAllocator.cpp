@@ -84,6 +84,12 @@ void descriptorBudgetFor(uint64_t soft, uint64_t hard, uint64_t *newSoft, uint64
 void *waitThenAllocate(uint64_t size, int32_t zeroFill) {
   pthread_mutex_lock(&totalPoolAllocsLock);
   if (maxPoolAllocs == 0) computeMemoryBudget();
+  if (size >= maxPoolAllocs) {
+    // No amount of memory given back would admit it: waiting would never end.
+    pthread_mutex_unlock(&totalPoolAllocsLock);
+    errno = ENOMEM;
+    return nullptr;
+  }
   if (totalPoolAllocs + size >= maxPoolAllocs) {
     // Memory comes back from other work, perhaps queued on this thread's own pool.
     workQueueBlockingBegin();

@@ -11,7 +11,8 @@
 
 // Blocks until size more bytes fit the memory budget, then allocates them (zero-filled when
 // zeroFill is non-zero). Returns the block, or NULL when the system has no memory (nothing is
-// then charged). Requests must stay below 100 MiB.
+// then charged). Requests should stay below 100 MiB; one that the whole budget cannot hold
+// returns NULL with ENOMEM at once instead of waiting for ever.
 void *waitThenAllocate(uint64_t size, int32_t zeroFill);
 
 // Frees a block from waitThenAllocate and gives its size (the same size) back to the budget.

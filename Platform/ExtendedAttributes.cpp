@@ -8,6 +8,7 @@
 #include <algorithm>
 #include <atomic>
 #include <bit>
+#include <climits>
 #include <cstring>
 #include <memory>
 #include <string>
@@ -134,8 +135,9 @@ class Names {
     snprintf(suffix, sizeof suffix, "%x.%llx", generation, static_cast<unsigned long long>(number));
     return reservedStem() + suffix;
   }
-  // True for any segment name of this value, whatever its generation; `generation` gets it.
-  bool isSegment(const std::string &linuxName, uint32_t *generation) const {
+  // True for any segment name of this value, whatever its generation; `generation` and
+  // `number` (when not null) get its parts.
+  bool isSegment(const std::string &linuxName, uint32_t *generation, uint64_t *number = nullptr) const {
     std::string stem = reservedStem();
     if (linuxName.compare(0, stem.size(), stem) != 0) return false;
     std::string_view rest(linuxName.c_str() + stem.size());
@@ -146,6 +148,7 @@ class Names {
     };
     if (!allHex(rest.substr(0, dot)) || !allHex(rest.substr(dot + 1))) return false;
     *generation = static_cast<uint32_t>(strtoul(std::string(rest.substr(0, dot)).c_str(), nullptr, 16));
+    if (number) *number = strtoull(std::string(rest.substr(dot + 1)).c_str(), nullptr, 16);
     return true;
   }
 
@@ -187,9 +190,15 @@ constexpr int kDamagedIndex = -2;
 // nothing about the value, which may well be intact.
 int readIndex(const Target &target, const Names &names, Index *index) {
   ssize_t got = target.get(names.index(), index, sizeof *index);
+  // A record longer than ours is damaged, like a short one; it must not pass for a full buffer.
+  if (got < 0 && errno == ERANGE) {
+    errno = EIO;
+    return -1;
+  }
   if (got < 0) return errno == ENODATA ? 0 : -1;
   if (got != sizeof *index || index->magic != kIndexMagic || index->version != kIndexVersion ||
-      index->segmentSize < 1024 || index->segmentSize > kLargestSegment) {
+      index->segmentSize < 1024 || index->segmentSize > kLargestSegment ||
+      index->length > static_cast<uint64_t>(SSIZE_MAX)) {
     errno = EIO;
     return kDamagedIndex;
   }
@@ -243,6 +252,26 @@ void removeSegments(const Target &target, const Names &names, uint32_t keepGener
   for (const std::string &linuxName : all) {
     uint32_t generation;
     if (names.isSegment(linuxName, &generation) && (keepGeneration == 0 || generation != keepGeneration))
+      target.remove(linuxName);
+  }
+}
+
+// Removes the segments of `generation` numbered from `from` up to `to` (excluded). A long range
+// is looked up in the file's names rather than tried number by number: a damaged index may
+// place a write gigabytes past the end.
+void removeSegmentRange(const Target &target, const Names &names, uint32_t generation, uint64_t from, uint64_t to) {
+  constexpr uint64_t kDirectRemovals = 16;
+  if (to <= from) return;
+  if (to - from <= kDirectRemovals) {
+    for (uint64_t number = from; number < to; number++) target.remove(names.segment(generation, number));
+    return;
+  }
+  std::vector<std::string> all;
+  if (!target.allNames(&all)) return;
+  for (const std::string &linuxName : all) {
+    uint32_t found;
+    uint64_t number;
+    if (names.isSegment(linuxName, &found, &number) && found == generation && number >= from && number < to)
       target.remove(linuxName);
   }
 }
@@ -513,30 +542,40 @@ int replaceValue(const Target &target, const Names &names, const uint8_t *value,
   return publishSegmented(target, names, segmentSize, generation, size, hadPlain, old != nullptr);
 }
 
+// Before a segmented value grows past its end: drops whatever an interrupted writer may have
+// left beyond the end in the segments numbered below `upTo`, so that the gap reads as zeros.
+// 0, or -1 with errno.
+int dropPastEnd(const Target &target, const Names &names, const Index &index, uint64_t upTo) {
+  const uint64_t segmentSize = index.segmentSize;
+  const uint64_t length = index.length;
+  uint64_t tail = length / segmentSize;
+  uint64_t kept = length % segmentSize;
+  if (kept != 0 && tail < upTo) {
+    ssize_t got = readSegment(target, names, index.generation, tail, scratch(), segmentSize);
+    if (got < 0) return -1;
+    if (static_cast<uint64_t>(got) > kept && writeSegment(target, names, index.generation, tail, scratch(), kept) != 0)
+      return -1;
+  }
+  removeSegmentRange(target, names, index.generation, (length + segmentSize - 1) / segmentSize, upTo);
+  return 0;
+}
+
 // Writes `size` bytes at `position` of a segmented value, extending it when they end past it.
 int writeIntoSegments(const Target &target, const Names &names, const Index &index, const uint8_t *value,
                       size_t size, uint64_t position) {
   const uint64_t segmentSize = index.segmentSize;
   const uint64_t length = index.length;
   const uint64_t end = position + size;
-  if (size == 0) return 0;
-  uint64_t first = position / segmentSize, last = (end - 1) / segmentSize;
-
-  if (position > length) {
-    // The gap between the old end and the write must read as zeros: drop whatever an
-    // interrupted writer may have left past the end.
-    uint64_t tail = length / segmentSize;
-    uint64_t kept = length % segmentSize;
-    if (kept != 0 && tail < first) {
-      ssize_t got = readSegment(target, names, index.generation, tail, scratch(), segmentSize);
-      if (got < 0) return -1;
-      if (static_cast<uint64_t>(got) > kept &&
-          writeSegment(target, names, index.generation, tail, scratch(), kept) != 0)
-        return -1;
-    }
-    for (uint64_t number = (length + segmentSize - 1) / segmentSize; number < first; number++)
-      target.remove(names.segment(index.generation, number));
+  if (size == 0) {
+    // Nothing to write, but a write past the end still extends the value to its position, as
+    // it does a plain value: the bytes up to there must read as zeros.
+    if (position <= length) return 0;
+    if (dropPastEnd(target, names, index, (position + segmentSize - 1) / segmentSize) != 0) return -1;
+    return writeIndex(target, names, index.segmentSize, index.generation, position);
   }
+  uint64_t first = position / segmentSize, last = (end - 1) / segmentSize;
+  // Segment `first` and those after it are rewritten below, gap included.
+  if (position > length && dropPastEnd(target, names, index, first) != 0) return -1;
 
   for (uint64_t number = first; number <= last; number++) {
     uint64_t start = number * segmentSize;
@@ -608,9 +647,12 @@ int setValue(const Target &target, const char *name, const void *value, size_t s
   const Index *current = indexed == 1 ? &index : nullptr;
   const uint8_t *bytes = static_cast<const uint8_t *>(value);
   if (fork) {
-    if (indexed < 0) {
+    // A damaged index goes; so does an index beside a plain value (a replacement interrupted
+    // between its two steps), because readers see the plain value and writes must change it.
+    if (indexed < 0 || (indexed == 1 && plainSize >= 0)) {
       target.remove(names.index());
       removeSegments(target, names, 0);
+      current = nullptr;
     }
     return writeAt(target, names, bytes, size, position, current);
   }

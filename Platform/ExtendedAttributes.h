@@ -10,8 +10,9 @@
 // - `position` is a byte offset, allowed only for the resource fork "com.tavix.ResourceFork";
 //   any other attribute with a non-zero position fails with EINVAL.
 // - Writing the resource fork at a position overwrites [position, position + size) and extends
-//   the value when that range ends past it; it never truncates. Bytes never written read as
-//   zeros. Every other attribute is replaced whole.
+//   the value when that range ends past it (a write of no bytes past the end extends it to the
+//   position); it never truncates. Bytes never written read as zeros. Every other attribute is
+//   replaced whole.
 // - Reading with a null buffer returns the value's length. Reading the resource fork copies
 //   what lies between position and the end (0 at or past the end); reading any other attribute
 //   into a buffer smaller than its value fails with ERANGE.

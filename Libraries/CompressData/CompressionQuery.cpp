@@ -37,6 +37,12 @@ int queryCompressionInfo(const char *path, CompressionInfo *info) {
     PLZC_ERR("%s:%d: Error: Could not get decmpfs xattr for path %s; %s (%d)\n", path, strerror(errno), errno);
     return -1;
   }
+  if (attributeSize > kMaxReadableHeaderSize) {
+    errno = EINVAL;
+    PLZC_ERR("%s:%d: Error: decmpfs xattr for path %s claims %lld bytes: damaged\n", path,
+             static_cast<long long>(attributeSize));
+    return -1;
+  }
   auto *attribute = static_cast<uint8_t *>(sys::malloc(attributeSize > 0 ? static_cast<size_t>(attributeSize) : 1));
   if (!attribute) return -1;
   ssize_t got = platform::getxattr(path, kDecmpfsXattrName, attribute, static_cast<size_t>(attributeSize), 0,

@@ -62,6 +62,12 @@ int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx) {
     PLZC_ERR("%s:%d: fh_getxattr(%s,%s): %s\n", fh->name, kDecmpfsXattrName, strerror(errno));
     return -1;
   }
+  if (size < 0 || size > kMaxReadableHeaderSize) {
+    errno = EINVAL;
+    PLZC_ERR("%s:%d: Error: %s of %s claims %lld bytes: damaged\n", kDecmpfsXattrName, fh->name,
+             static_cast<long long>(size));
+    return -1;
+  }
   uint64_t blockSize = static_cast<uint64_t>(size) + 4;
   auto *block = static_cast<AttrBuffer *>(waitThenAllocate(blockSize, 0));
   if (!block) {

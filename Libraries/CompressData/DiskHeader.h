@@ -20,6 +20,9 @@ constexpr uint32_t kCompressedFlag = kFlagCompressed;
 constexpr int kShowCompressionOption = kXattrShowCompression;
 constexpr uint32_t kDiskHeaderSize = 16;
 constexpr uint32_t kMaxType3AttributeSize = 3802;
+// The longest header attribute a reader takes in. Writers make at most 3802 bytes, but a
+// damaged file may claim any length, which must not turn into an allocation of that size.
+constexpr int64_t kMaxReadableHeaderSize = 1048576;
 
 struct DiskHeader {
   uint32_t magic;

@@ -9,6 +9,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <cerrno>
 #include <functional>
 #include <chrono>
 #include <fstream>
@@ -89,6 +90,17 @@ TEST(ThrottlingAllocator, RequestIsAdmittedOnlyWhileTheTotalStaysBelowTheBudget)
     freeAndSignal(held, 40000000);
     EXPECT_TRUE(tooLarge.admittedWithin(std::chrono::seconds(10)));
   }
+  EXPECT_EQ(throttlingMemoryCharged(), 0u);
+}
+
+TEST(ThrottlingAllocator, RequestNoBudgetCanHoldFailsAtOnce) {
+  throttlingSetMemoryBudget(104857600);
+  auto started = std::chrono::steady_clock::now();
+  errno = 0;
+  EXPECT_EQ(waitThenAllocate(104857600, 0), nullptr);  // the total must stay below the budget
+  EXPECT_EQ(errno, ENOMEM);
+  EXPECT_EQ(waitThenAllocate(1ull << 40, 1), nullptr);
+  EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(5));
   EXPECT_EQ(throttlingMemoryCharged(), 0u);
 }
 

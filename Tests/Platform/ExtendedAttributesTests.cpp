@@ -9,6 +9,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <cstring>
 #include <random>
 #include <thread>
@@ -111,6 +112,19 @@ TEST_F(ExtendedAttributes, GapsReadAsZerosAndTheValueNeverShrinks) {
   std::copy(head.begin(), head.end(), expected.begin());
   std::copy(tail.begin(), tail.end(), expected.begin() + far);
   EXPECT_EQ(readAll(kFork), expected);
+}
+
+TEST_F(ExtendedAttributes, EmptyWritePastTheEndExtendsPlainAndSegmentedForksAlike) {
+  for (size_t start : {size_t(10), 3 * kPiece + 5}) {
+    std::vector<uint8_t> fork = randomBytes(start, 17);
+    writePiece(fork, 0, fork.size());
+    for (uint32_t position : {uint32_t(start), uint32_t(start + 100), uint32_t(5 * kPiece + 7)}) {
+      ASSERT_EQ(platform::setxattr(path.c_str(), kFork, fork.data(), 0, position, 0), 0) << strerror(errno);
+      fork.resize(std::max<size_t>(fork.size(), position), 0);
+      EXPECT_EQ(readAll(kFork), fork) << "from " << start << " to " << position;
+    }
+    ASSERT_EQ(platform::removexattr(path.c_str(), kFork, 0), 0);
+  }
 }
 
 TEST_F(ExtendedAttributes, SmallValueIsAnOrdinaryLinuxAttribute) {
@@ -303,6 +317,52 @@ TEST_F(ExtendedAttributes, ReaderSeesOldOrNewValueNeverAMix) {
   }
   writer.join();
   EXPECT_GT(reads, 0);
+}
+
+// An index record as the layer stores it: magic "PzSX", version 1, segment size, generation,
+// length.
+std::vector<uint8_t> indexRecord(uint32_t segmentSize, uint32_t generation, uint64_t length) {
+  std::vector<uint8_t> record(24);
+  const uint32_t words[] = {0x58537A50, 1, segmentSize, generation};
+  memcpy(record.data(), words, sizeof words);
+  memcpy(record.data() + 16, &length, sizeof length);
+  return record;
+}
+
+TEST_F(ExtendedAttributes, DamagedLayoutsFoundOnDiskGiveWayToTheNextWrite) {
+  const std::string forkIndex = std::string("user.plzc#") + kFork + "#i";
+  auto setRaw = [&](const std::string &name, const std::vector<uint8_t> &value) {
+    ASSERT_EQ(::setxattr(path.c_str(), name.c_str(), value.data(), value.size(), 0), 0) << strerror(errno);
+  };
+  uint8_t bytes[3] = {1, 2, 3}, back[3] = {};
+
+  // An index record longer than any the layer writes is damaged, not a buffer too small.
+  setRaw("user.plzc#x#i", std::vector<uint8_t>(30, 7));
+  EXPECT_EQ(platform::getxattr(path.c_str(), "x", nullptr, 0, 0, 0), -1);
+  EXPECT_EQ(errno, EIO);
+  ASSERT_EQ(platform::setxattr(path.c_str(), "x", bytes, 3, 0, 0), 0) << strerror(errno);
+  EXPECT_EQ(readAll("x"), std::vector<uint8_t>(bytes, bytes + 3));
+
+  // A length no read could return is damaged too.
+  setRaw("user.plzc#y#i", indexRecord(kPiece, 5, (1ull << 63) + 5));
+  EXPECT_EQ(platform::getxattr(path.c_str(), "y", nullptr, 0, 0, 0), -1);
+  EXPECT_EQ(errno, EIO);
+
+  // An index left beside a plain fork: readers see the plain value, so a write must change it.
+  setRaw(std::string("user.") + kFork, std::vector<uint8_t>(10, '0'));
+  setRaw(forkIndex, indexRecord(kPiece, 9, 100));
+  ASSERT_EQ(platform::setxattr(path.c_str(), kFork, bytes, 3, 4, 0), 0) << strerror(errno);
+  ASSERT_EQ(platform::getxattr(path.c_str(), kFork, back, 3, 4, 0), 3);
+  EXPECT_EQ(memcmp(back, bytes, 3), 0);
+  EXPECT_EQ(readAll(kFork).size(), 10u);
+
+  // A write far past the end of a value with small segments removes only the segments there are.
+  ASSERT_EQ(platform::removexattr(path.c_str(), kFork, 0), 0);
+  setRaw(forkIndex, indexRecord(1024, 9, 0));
+  auto started = std::chrono::steady_clock::now();
+  ASSERT_EQ(platform::setxattr(path.c_str(), kFork, bytes, 3, 0xFFFFF000u, 0), 0) << strerror(errno);
+  EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(2));
+  EXPECT_EQ(platform::getxattr(path.c_str(), kFork, nullptr, 0, 0, 0), 0xFFFFF003);
 }
 
 TEST_F(ExtendedAttributes, ArgumentsAndOptionsBehaveAsDocumented) {

@@ -15,7 +15,6 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <random>
 #include <thread>
 
 #include "Plenzo.h"
@@ -85,28 +84,6 @@ std::string writeFile(const std::string &path, const std::string &text) {
 std::vector<uint8_t> readFile(const std::string &path) {
   std::ifstream in(path, std::ios::binary);
   return std::vector<uint8_t>(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
-}
-
-std::vector<uint8_t> randomBytes(size_t count, uint32_t seed) {
-  std::mt19937 generator(seed);
-  std::vector<uint8_t> bytes(count);
-  for (auto &byte : bytes) byte = static_cast<uint8_t>(generator());
-  return bytes;
-}
-
-std::vector<uint8_t> compressibleBytes(size_t count, uint32_t seed) {
-  std::vector<uint8_t> bytes;
-  bytes.reserve(count + 64);
-  uint32_t state = seed;
-  while (bytes.size() < count) {
-    state = state * 1103515245 + 12345;
-    char line[64];
-    int n = snprintf(line, sizeof line, "entry %u value %u name item-%u\n", static_cast<unsigned>(bytes.size()),
-                     (state >> 16) % 1000, (state >> 8) % 97);
-    bytes.insert(bytes.end(), line, line + n);
-  }
-  bytes.resize(count);
-  return bytes;
 }
 
 std::string catFileTo(const std::string &path, const std::function<void(const uint8_t *, size_t)> &sink) {

@@ -10,6 +10,8 @@
 #include <string>
 #include <vector>
 
+#include "SampleData.h"
+
 namespace plzctest {
 
 // A fresh directory under $PLZC_TEST_DIR (or /dev/shm), removed with its contents on
@@ -33,10 +35,6 @@ class ScratchDir {
 std::string writeFile(const std::string &path, const std::vector<uint8_t> &bytes);
 std::string writeFile(const std::string &path, const std::string &text);
 std::vector<uint8_t> readFile(const std::string &path);
-// Deterministic pseudo-random bytes.
-std::vector<uint8_t> randomBytes(size_t count, uint32_t seed);
-// Deterministic text lines that deflate shrinks several times over, but not to nothing.
-std::vector<uint8_t> compressibleBytes(size_t count, uint32_t seed);
 
 // Runs the library's catFile on path with its standard output handed, piece by piece, to sink
 // (on the calling thread); returns what catFile printed on standard error, empty when it read
