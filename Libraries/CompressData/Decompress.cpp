@@ -156,8 +156,12 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
     }
     fd = *static_cast<int32_t *>(fh->priv);
     struct stat opened;
-    if (sys::fstat(fd, &opened) != 0 || opened.st_dev != initial.st.st_dev || opened.st_ino != initial.st.st_ino) {
-      if (errno != EIO) errno = ESTALE;
+    if (sys::fstat(fd, &opened) != 0) {
+      PLZC_ERR("%s:%d: Error: Failed to stat compressed file at path '%s': %s (%d)\n", path, strerror(errno), errno);
+      return fail();
+    }
+    if (opened.st_dev != initial.st.st_dev || opened.st_ino != initial.st.st_ino) {
+      errno = ESTALE;
       PLZC_ERR("%s:%d: Error: File '%s' was replaced while being decompressed: %s (%d)\n", path, strerror(errno),
                errno);
       return fail();

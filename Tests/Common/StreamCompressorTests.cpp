@@ -433,6 +433,7 @@ TEST_F(StreamCompressor, StreamWithoutMemoryForItsDataNamesTheFile) {
   std::string path = dir.file("second.txt");
   int fd = open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC, 0644);
   ASSERT_GE(fd, 0);
+  ASSERT_TRUE(_SQLazyInit(queue));  // its own allocations are not the ones failed here
   sys::armFault(sys::Call::Calloc, 1, ENOMEM);
   CaptureStderr();
   ::StreamCompressor *stream = CreateStreamCompressor(fd, path.c_str(), dir.path().c_str(), queue, 50000);
