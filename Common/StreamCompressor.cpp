@@ -174,79 +174,60 @@ void _SCCompressFile(void *context) {
 bool storeCompressedForm(StreamCompressor *stream) {
   StreamCompressorQueue *queue = stream->queue;
   bool success = false;
-  uint8_t *savedFork = nullptr;
-  int64_t savedForkSize = 0;
-  bool forkUnreadable = false;
 
   ssize_t forkSize = platform::fgetxattr(stream->fd, kResourceForkXattrName, nullptr, 0, 0, 0);
   if (forkSize < 0 && errno != ENOATTR) {
     recordError(queue, errno);
     PLZC_ERR("%s:%d: Error: fgetxattr failed for %s: %s\n", stream->path, strerror(errno));
-  } else if (forkSize > 0) {
-    // The caller gave the file a resource fork of its own: keep its bytes in hand.
-    savedFork = static_cast<uint8_t *>(sys::malloc(static_cast<size_t>(forkSize)));
-    ssize_t got = savedFork ? platform::fgetxattr(stream->fd, kResourceForkXattrName, savedFork,
-                                                  static_cast<size_t>(forkSize), 0, 0)
-                            : -1;
-    if (got < 0) {
-      if (!savedFork) errno = ENOMEM;
-      recordError(queue, errno);
-      PLZC_ERR("%s:%d: Error: fgetxattr failed for %s: %s\n", stream->path, strerror(errno));
-      forkUnreadable = true;
-    } else {
-      savedForkSize = got;
-      if (platform::fremovexattr(stream->fd, kResourceForkXattrName, 0) != 0)
-        PLZC_ERR("%s:%d: fremovexattr failed for %s: %s\n", stream->path, strerror(errno));
-    }
   }
-
-  // A fork that could not be read stays as it is: the compressed form would overwrite it.
-  if (!forkUnreadable) {
-    if (applyTocDictToFd(stream->fd, stream->tocDict) == 0) {
-      if (!queue->inPlace) {
-        success = true;
-      } else if (sys::truncate(stream->path, 0) != 0) {
-        recordError(queue, errno);
-        PLZC_ERR("%s:%d: Error: ftruncate failed for %s: %s\n", stream->path, strerror(errno));
-      } else {
-        success = true;
-      }
+  if (forkSize > 0) {
+    // The caller gave the file a resource fork of its own, so it never ends compressed: it ends
+    // with its data in the data fork and that fork as it is. Linux expands no file by itself,
+    // so the write-out reaches that state directly, without ever taking the fork off the file
+    // (a process that dies must not take the fork with it): a new file gets the data
+    // decompressed into its data fork; an existing file's data fork still holds its data.
+    if (!queue->inPlace && decompressData(stream->handle, _SCWriteFailed, stream) == -1) {
+      recordError(queue, errno ? errno : EIO);
+      PLZC_ERR("%s:%d: Error: decompressData failed for %s\n", stream->path);
+    }
+  } else if (applyTocDictToFd(stream->fd, stream->tocDict) == 0) {
+    if (!queue->inPlace) {
+      success = true;
+    } else if (sys::fsync(stream->fd) != 0) {
+      // The data fork may go only once the compressed form would survive a power loss.
+      recordError(queue, errno);
+      PLZC_ERR("%s:%d: Error: fsync failed for %s: %s\n", stream->path, strerror(errno));
     } else {
-      int error = errno;
-      if (queue->ignoreXattrErrors && !queue->inPlace) {
-        PLZC_ERR("%s:%d: Compressed data for %s could not be written; writing decompressed data: %s\n", stream->path,
-                 strerror(error));
-        if (decompressData(stream->handle, _SCWriteFailed, stream) == -1) {
-          PLZC_ERR("%s:%d: Error: decompressData failed for %s\n", stream->path);
-          recordError(queue, error);
-        }
-      } else if (queue->ignoreXattrErrors) {
-        PLZC_ERR("%s:%d: Compressed data for %s could not be written: %s\n", stream->path, strerror(error));
-      } else {
+      // Marked compressed before the data fork goes, so that readers find the whole data at
+      // every instant; the final flags are set at the end of the write-out.
+      platform::fchflags(stream->fd, kCompressedFlag);
+      if (sys::truncate(stream->path, 0) != 0) {
+        int error = errno;
+        platform::fchflags(stream->fd, 0);
         recordError(queue, error);
-        PLZC_ERR("%s:%d: Error: applyTocDictToFd failed for %s: %s\n", stream->path, strerror(error));
+        PLZC_ERR("%s:%d: Error: ftruncate failed for %s: %s\n", stream->path, strerror(error));
+      } else {
+        success = true;
       }
+    }
+  } else {
+    int error = errno;
+    if (queue->ignoreXattrErrors && !queue->inPlace) {
+      PLZC_ERR("%s:%d: Compressed data for %s could not be written; writing decompressed data: %s\n", stream->path,
+               strerror(error));
+      if (decompressData(stream->handle, _SCWriteFailed, stream) == -1) {
+        PLZC_ERR("%s:%d: Error: decompressData failed for %s\n", stream->path);
+        recordError(queue, error);
+      }
+    } else if (queue->ignoreXattrErrors) {
+      PLZC_ERR("%s:%d: Compressed data for %s could not be written: %s\n", stream->path, strerror(error));
+    } else {
+      recordError(queue, error);
+      PLZC_ERR("%s:%d: Error: applyTocDictToFd failed for %s: %s\n", stream->path, strerror(error));
     }
   }
   PVRelease(stream->tocDict);
   stream->tocDict = nullptr;
-
-  if (savedFork && !forkUnreadable) {
-    // A file with a resource fork of its own never ends compressed. No Linux file system
-    // expands such a file by itself: put its data back into the data fork, drop the compressed
-    // form, then write the caller's fork back.
-    success = false;
-    if (decompressData(stream->handle, _SCWriteFailed, stream) == -1)
-      PLZC_ERR("%s:%d: Error: decompressData failed for %s\n", stream->path);
-    platform::fremovexattr(stream->fd, kDecmpfsXattrName, 0);
-    platform::fremovexattr(stream->fd, kResourceForkXattrName, 0);
-    if (platform::fsetxattr(stream->fd, kResourceForkXattrName, savedFork, static_cast<size_t>(savedForkSize), 0,
-                            0) != 0) {
-      recordError(queue, errno);
-      PLZC_ERR("%s:%d: Error: fsetxattr failed for %s: %s\n", stream->path, strerror(errno));
-    }
-  }
-  free(savedFork);
   closeHandle(&stream->handle);
   return success;
 }

@@ -111,6 +111,15 @@ class ChunkInflater {
     if (*result == Z_STREAM_END) return true;
     return (*result == Z_OK || *result == Z_BUF_ERROR) && stream_.avail_out == 0;
   }
+  // Inflates the whole chunk into space bytes at output: the bytes produced when the stream
+  // ended (checksum included) at the chunk's last byte, -1 otherwise.
+  int64_t inflateWhole(uint8_t *output, uint32_t space) {
+    stream_.next_out = output;
+    stream_.avail_out = space;
+    int result = inflate(&stream_, Z_FINISH);
+    if (result != Z_STREAM_END || stream_.avail_in != 0) return -1;
+    return space - stream_.avail_out;
+  }
   bool chunkDone() const { return ended_ || stream_.avail_in == 0; }
   void dump(const uint8_t *chunk, uint32_t length) { dumpBadChunk(&stream_, chunk, length); }
 
@@ -365,4 +374,16 @@ int64_t chunkingDecompressor(int64_t offset, uint64_t size, uint32_t vectorCount
     skip = 0;
   }
   return static_cast<int64_t>(total);
+}
+
+int64_t decodeWholeChunk(const uint8_t *chunk, uint32_t length, uint8_t *out, uint32_t capacity) {
+  if (length == 0) return -1;
+  if (chunk[0] == kStoredChunkMarker) {
+    if (length - 1 > capacity) return -1;
+    memcpy(out, chunk + 1, length - 1);
+    return length - 1;
+  }
+  ChunkInflater inflater;
+  inflater.begin(chunk, length);
+  return inflater.inflateWhole(out, capacity);
 }

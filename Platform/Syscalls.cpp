@@ -71,6 +71,7 @@ ssize_t pwrite(int fd, const void *buffer, size_t count, off_t offset) {
 }
 int ftruncate(int fd, off_t length) { PLZC_WRAP(Ftruncate, -1, ::ftruncate(fd, length)); }
 int truncate(const char *path, off_t length) { PLZC_WRAP(Truncate, -1, ::truncate(path, length)); }
+int fsync(int fd) { PLZC_WRAP(Fsync, -1, ::fsync(fd)); }
 int stat(const char *path, struct ::stat *st) { PLZC_WRAP(Stat, -1, ::stat(path, st)); }
 int lstat(const char *path, struct ::stat *st) { PLZC_WRAP(Lstat, -1, ::lstat(path, st)); }
 int fstat(int fd, struct ::stat *st) { PLZC_WRAP(Fstat, -1, ::fstat(fd, st)); }

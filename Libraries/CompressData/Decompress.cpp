@@ -159,6 +159,23 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
       fh->close(fh);
       return -1;
     }
+    // Whatever moment the process dies at, a reader must find the whole data: in the
+    // compressed form while the file is marked compressed, in the data fork from the moment it
+    // is not. So the data is made durable, then the file's own flags (without the compressed
+    // flag) are set, and only then the compressed form is removed.
+    if (fh->sync(fh) == -1) {
+      PLZC_ERR("%s:%d: Error: Failed to flush the data of file at path '%s': %s (%d)\n", path, strerror(errno),
+               errno);
+      fh->close(fh);
+      return -1;
+    }
+    if (platform::chflags(path, initial.st_flags & ~kCompressedFlag) != 0) {
+      PLZC_ERR("%s:%d: Error: Failed to set flags of compressed file at path '%s': %s (%d)\n", path,
+               strerror(errno), errno);
+      fh->close(fh);
+      return -1;
+    }
+    restoreFlags = false;
     for (const char *name : {kDecmpfsXattrName, kResourceForkXattrName}) {
       if (fh->removexattr(fh, name, 0) == -1 && !(name == kResourceForkXattrName && errno == ENOATTR)) {
         PLZC_ERR("%s:%d: Error: Failed to remove %s xattr of file at path '%s': %s (%d)\n", name, path,
@@ -168,7 +185,6 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
       }
     }
     fh->close(fh);
-    restoreFlags = true;
   }
   struct timeval times[2] = {toTimeval(initial.st.st_atim), toTimeval(initial.st.st_mtim)};
   if (sys::utimes(path, times) != 0) {
