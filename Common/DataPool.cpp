@@ -300,6 +300,7 @@ const FileHandle kPoolFileTemplate = {
     .getxattr = poolGetxattr,
     .setxattr = nullptr,
     .removexattr = nullptr,
+    .sync = nullptr,  // nothing of it is on disk
     .priv = nullptr,
 };
 

@@ -59,6 +59,9 @@ struct FileHandle {
   int (*setxattr)(FileHandle *fh, const char *name, const void *buffer, uint64_t size, uint32_t position,
                   int options);
   int (*removexattr)(FileHandle *fh, const char *name, int options);
+  // Makes the file's data and attributes durable (they survive a power loss); 0 or -1. Null
+  // for kinds that keep nothing on disk.
+  int (*sync)(FileHandle *fh);
 
   void *priv;  // the kind's private state
 };

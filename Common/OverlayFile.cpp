@@ -295,6 +295,7 @@ const FileHandle kOverlayTemplate = {
     .getxattr = overlayGetxattr,
     .setxattr = overlaySetxattr,
     .removexattr = overlayRemovexattr,
+    .sync = nullptr,  // nothing of it is on disk
     .priv = nullptr,
 };
 

@@ -159,6 +159,14 @@ int plainRemovexattr(FileHandle *fh, const char *name, int options) {
   return 0;
 }
 
+int plainSync(FileHandle *fh) {
+  if (sys::fsync(descriptor(fh)) != 0) {
+    PLZC_ERR("%s:%d: fsync: %s\n", strerror(errno));
+    return -1;
+  }
+  return 0;
+}
+
 const FileHandle kPlainFileTemplate = {
     .name = nullptr,
     .path = nullptr,
@@ -181,6 +189,7 @@ const FileHandle kPlainFileTemplate = {
     .getxattr = plainGetxattr,
     .setxattr = plainSetxattr,
     .removexattr = plainRemovexattr,
+    .sync = plainSync,
     .priv = nullptr,
 };
 

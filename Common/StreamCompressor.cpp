@@ -200,17 +200,26 @@ void _SCCompressFile(void *context) {
 bool storeCompressedForm(StreamCompressor *stream) {
   StreamCompressorQueue *queue = stream->queue;
   bool success = false;
+  // An in-place file whose data fork cannot go keeps its data and loses the compressed form
+  // just stored.
+  auto keepData = [&](const char *step, int error) {
+    recordError(queue, error);
+    PLZC_ERR("%s:%d: Error: %s failed for %s: %s\n", step, stream->path, strerror(error));
+    platform::fremovexattr(stream->fd, kDecmpfsXattrName, 0);
+    platform::fremovexattr(stream->fd, kResourceForkXattrName, 0);
+    errno = error;
+  };
   ssize_t forkSize = platform::fgetxattr(stream->fd, kResourceForkXattrName, nullptr, 0, 0, 0);
   if (forkSize < 0 && errno != ENOATTR) {
     // A fork that cannot be sized may be the caller's own: the compressed form would replace it.
     recordError(queue, errno);
     PLZC_ERR("%s:%d: Error: fgetxattr failed for %s: %s\n", stream->path, strerror(errno));
   } else if (forkSize > 0) {
-    // The caller gave the file a resource fork of its own, so the file never ends compressed:
-    // plain data, the caller's fork, no compression attributes. No Linux file system expands a
-    // compressed file whose fork is rewritten, so the write-out reaches that state directly and
-    // never takes the caller's fork off the file: a new file gets its data decompressed from the
-    // compressed form, an existing one keeps its data fork.
+    // The caller gave the file a resource fork of its own, so it never ends compressed: it ends
+    // with its data in the data fork and that fork as it is. Linux expands no file by itself,
+    // so the write-out reaches that state directly, without ever taking the fork off the file
+    // (a process that dies must not take the fork with it): a new file gets the data
+    // decompressed into its data fork; an existing file's data fork still holds its data.
     if (!queue->inPlace && decompressData(stream->handle, _SCWriteFailed, stream) == -1) {
       recordError(queue, errno ? errno : EIO);
       PLZC_ERR("%s:%d: Error: decompressData failed for %s\n", stream->path);
@@ -218,18 +227,24 @@ bool storeCompressedForm(StreamCompressor *stream) {
   } else if (applyTocDictToFd(stream->fd, stream->tocDict) == 0) {
     if (!queue->inPlace) {
       success = true;
-    } else if (!platform::pathNamesOpenFile(stream->path, stream->fd) || sys::truncate(stream->path, 0) != 0) {
+    } else if (sys::fsync(stream->fd) != 0) {
+      // The data fork may go only once the compressed form would survive a power loss.
+      keepData("fsync", errno);
+    } else if (!platform::pathNamesOpenFile(stream->path, stream->fd)) {
       // The descriptor may be read-only, so the data is cut by path; never that of a file
-      // renamed into its place meanwhile, whose data would be lost. This file keeps its data
-      // and loses the compressed form just stored.
-      int error = errno;
-      recordError(queue, error);
-      PLZC_ERR("%s:%d: Error: ftruncate failed for %s: %s\n", stream->path, strerror(error));
-      platform::fremovexattr(stream->fd, kDecmpfsXattrName, 0);
-      platform::fremovexattr(stream->fd, kResourceForkXattrName, 0);
-      errno = error;
+      // renamed into its place meanwhile, whose data would be lost.
+      keepData("ftruncate", errno);
     } else {
-      success = true;
+      // Marked compressed before the data fork goes, so that readers find the whole data at
+      // every instant; the final flags are set at the end of the write-out.
+      platform::fchflags(stream->fd, kCompressedFlag);
+      if (sys::truncate(stream->path, 0) != 0) {
+        int error = errno;
+        platform::fchflags(stream->fd, 0);
+        keepData("ftruncate", error);
+      } else {
+        success = true;
+      }
     }
   } else {
     int error = errno;

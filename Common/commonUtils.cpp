@@ -276,3 +276,23 @@ int64_t chunkingDecompressor(int64_t offset, uint64_t size, uint32_t vectorCount
   }
   return static_cast<int64_t>(total);
 }
+
+int64_t decodeWholeChunk(const uint8_t *chunk, uint32_t length, uint8_t *out, uint32_t capacity) {
+  if (length == 0) return -1;
+  if (chunk[0] == kStoredChunkMarker) {
+    if (length - 1 > capacity) return -1;
+    memcpy(out, chunk + 1, length - 1);
+    return length - 1;
+  }
+  // zlib itself, whatever the engine: the check must not depend on the decoder in use.
+  z_stream stream{};
+  if (inflateInit(&stream) != Z_OK) return -1;
+  stream.next_in = const_cast<Bytef *>(chunk);
+  stream.avail_in = length;
+  stream.next_out = out;
+  stream.avail_out = capacity;
+  int result = inflate(&stream, Z_FINISH);
+  int64_t produced = result == Z_STREAM_END && stream.avail_in == 0 ? capacity - stream.avail_out : -1;
+  inflateEnd(&stream);
+  return produced;
+}

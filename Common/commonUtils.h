@@ -48,3 +48,9 @@ void chunkingGiveBackAll(FileHandle *handle, int64_t size, uint32_t chunkSize, i
 int64_t chunkingDecompressor(int64_t offset, uint64_t size, uint32_t vectorCount, const struct iovec *vectors,
                              uint32_t chunkSize, int32_t prefixBytes, int32_t suffixBytes, void *state,
                              SupplyChunkFn supplyChunk);
+
+// Decodes one whole chunk into out: a zlib stream that must end, with its Adler-32 checked,
+// exactly at the chunk's last byte, or a stored chunk. Returns the bytes produced, or -1 when
+// the chunk is anything else or holds more than capacity bytes. For checking a compressed form
+// as a whole (the readers above accept the first bytes of a chunk without its trailer).
+int64_t decodeWholeChunk(const uint8_t *chunk, uint32_t length, uint8_t *out, uint32_t capacity);

@@ -10,6 +10,7 @@
 #include <bit>
 #include <climits>
 #include <cstring>
+#include <map>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -193,7 +194,7 @@ int readIndex(const Target &target, const Names &names, Index *index) {
   // A record longer than ours is damaged, like a short one; it must not pass for a full buffer.
   if (got < 0 && errno == ERANGE) {
     errno = EIO;
-    return -1;
+    return kDamagedIndex;
   }
   if (got < 0) return errno == ENODATA ? 0 : -1;
   if (got != sizeof *index || index->magic != kIndexMagic || index->version != kIndexVersion ||
@@ -712,7 +713,84 @@ ssize_t listValues(const Target &target, char *out, size_t size, int options) {
   return static_cast<ssize_t>(needed);
 }
 
+// The reserved names of one value, as found on a file.
+struct ReservedParts {
+  bool hasIndex = false;
+  struct Segment {
+    std::string linuxName;
+    uint32_t generation;
+    uint64_t number;
+  };
+  std::vector<Segment> segments;
+};
+
+// Splits a segment suffix "<generation hex>.<number hex>"; false for anything else.
+bool parseSegmentSuffix(std::string_view suffix, uint32_t *generation, uint64_t *number) {
+  size_t dot = suffix.find('.');
+  if (dot == std::string_view::npos || dot == 0 || dot + 1 == suffix.size() || dot > 8 || suffix.size() - dot > 17)
+    return false;
+  auto allHex = [](std::string_view digits) {
+    return std::all_of(digits.begin(), digits.end(), [](char c) { return isxdigit(static_cast<unsigned char>(c)); });
+  };
+  if (!allHex(suffix.substr(0, dot)) || !allHex(suffix.substr(dot + 1))) return false;
+  *generation = static_cast<uint32_t>(strtoul(std::string(suffix.substr(0, dot)).c_str(), nullptr, 16));
+  *number = strtoull(std::string(suffix.substr(dot + 1)).c_str(), nullptr, 16);
+  return true;
+}
+
+ssize_t listUnowned(const Target &target, std::vector<std::string> *out) {
+  std::vector<std::string> all;
+  if (!target.allNames(&all)) return -1;
+  // Every reserved value name is "user.plzc#" N "#" suffix; N may hold '#', the suffix never.
+  std::map<std::string, ReservedParts> values;
+  const std::string reserved = kReservedLinuxPrefix;
+  for (const std::string &linuxName : all) {
+    if (linuxName.compare(0, reserved.size(), reserved) != 0) continue;
+    std::string_view rest(linuxName.c_str() + reserved.size());
+    size_t hash = rest.rfind('#');
+    if (hash == std::string_view::npos || hash == 0) continue;  // the flag word, for one
+    std::string valueName(rest.substr(0, hash));
+    std::string_view suffix = rest.substr(hash + 1);
+    ReservedParts::Segment segment{linuxName, 0, 0};
+    if (suffix == "i")
+      values[valueName].hasIndex = true;
+    else if (parseSegmentSuffix(suffix, &segment.generation, &segment.number))
+      values[valueName].segments.push_back(segment);
+  }
+  out->clear();
+  for (const auto &[valueName, parts] : values) {
+    Names names(valueName.c_str());
+    Index index{};
+    int found = parts.hasIndex ? readIndex(target, names, &index) : 0;
+    if (found < 0 && errno == EIO) continue;  // damaged: what it owns cannot be known
+    if (found < 0) return -1;
+    bool hidden = false;
+    if (found == 1) {
+      if (target.get(names.plain(), nullptr, 0) >= 0) hidden = true;  // readers see the plain value
+      else if (errno != ENODATA) return -1;
+    }
+    if (hidden) out->push_back(names.index());
+    uint64_t published = found == 1 ? (index.length + index.segmentSize - 1) / index.segmentSize : 0;
+    for (const ReservedParts::Segment &segment : parts.segments)
+      if (found != 1 || hidden || segment.generation != index.generation || segment.number >= published)
+        out->push_back(segment.linuxName);
+  }
+  return static_cast<ssize_t>(out->size());
+}
+
 }  // namespace
+
+ssize_t flistunownedsegments(int fd, std::vector<std::string> *names) { return listUnowned(Target::ofFd(fd), names); }
+
+int fremoveunownedsegments(int fd, const std::vector<std::string> &names) {
+  Target target = Target::ofFd(fd);
+  int firstError = 0;
+  for (const std::string &linuxName : names)
+    if (target.remove(linuxName) != 0 && errno != ENODATA && firstError == 0) firstError = errno;
+  if (firstError == 0) return 0;
+  errno = firstError;
+  return -1;
+}
 
 XattrSegmentCounters &xattrSegmentCounters() { return counters(); }
 

@@ -53,6 +53,9 @@ enum {
 #define PLZC_RESOURCE_FORK_NAME "com.tavix.ResourceFork"
 
 #ifdef __cplusplus
+#include <string>
+#include <vector>
+
 namespace platform {
 
 // Attribute size (null value) or bytes copied; -1 with errno.
@@ -99,6 +102,25 @@ class XattrReadCache {
 
 // The Linux attribute name prefix of the layer's reserved names ("user.plzc#").
 extern const char kReservedLinuxPrefix[];
+
+// Leftovers of interrupted writers: reserved Linux attributes that no value owns.
+//
+// A writer that dies while it replaces, extends or removes a large value can leave behind
+// segments of a generation it never published, or of the generation it was replacing;
+// segments past the published length; segments whose index was already removed; and, when it
+// died between publishing a segmented value and removing the small value it replaced, a whole
+// index with its segments, hidden behind the small value that readers still see. No reader
+// ever looks at them: they only take room, and they may be removed as long as no writer is
+// working on the file.
+//
+// flistunownedsegments: replaces *names with the Linux names of those attributes of the file
+// open at fd, every index before the segments of its value. Returns their count, or -1 with
+// errno. A value whose index record is damaged is left out: what it owns cannot be known.
+// fremoveunownedsegments: removes the given Linux names (as listed by the call above, with no
+// writer on the file since); a name already gone is no failure. 0, or -1 with the errno of the
+// first failure, after trying every name.
+ssize_t flistunownedsegments(int fd, std::vector<std::string> *names);
+int fremoveunownedsegments(int fd, const std::vector<std::string> &names);
 
 }  // namespace platform
 #endif

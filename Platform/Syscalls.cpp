@@ -89,6 +89,7 @@ ssize_t pwrite(int fd, const void *buffer, size_t count, off_t offset) {
 }
 int ftruncate(int fd, off_t length) { PLZC_WRAP_RESTARTING(Ftruncate, ::ftruncate(fd, length)); }
 int truncate(const char *path, off_t length) { PLZC_WRAP_RESTARTING(Truncate, ::truncate(path, length)); }
+int fsync(int fd) { PLZC_WRAP_RESTARTING(Fsync, ::fsync(fd)); }
 int stat(const char *path, struct ::stat *st) { PLZC_WRAP(Stat, -1, ::stat(path, st)); }
 int lstat(const char *path, struct ::stat *st) { PLZC_WRAP(Lstat, -1, ::lstat(path, st)); }
 int fstat(int fd, struct ::stat *st) { PLZC_WRAP(Fstat, -1, ::fstat(fd, st)); }

@@ -27,7 +27,7 @@ namespace sys {
 
 // One entry per wrapped call; used to arm faults and to read call counts.
 enum class Call : int {
-  Open, Close, Read, Write, Pread, Pwrite, Ftruncate, Truncate,
+  Open, Close, Read, Write, Pread, Pwrite, Ftruncate, Truncate, Fsync,
   Stat, Lstat, Fstat, Statfs, Fstatfs,
   Getxattr, Lgetxattr, Fgetxattr, Setxattr, Lsetxattr, Fsetxattr,
   Removexattr, Lremovexattr, Fremovexattr, Listxattr, Llistxattr, Flistxattr,
@@ -43,6 +43,8 @@ ssize_t pread(int fd, void *buffer, size_t count, off_t offset);
 ssize_t pwrite(int fd, const void *buffer, size_t count, off_t offset);
 int ftruncate(int fd, off_t length);
 int truncate(const char *path, off_t length);
+// Makes the file's data and metadata (attributes included) durable.
+int fsync(int fd);
 int stat(const char *path, struct ::stat *st);
 int lstat(const char *path, struct ::stat *st);
 int fstat(int fd, struct ::stat *st);

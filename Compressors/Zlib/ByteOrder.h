@@ -27,6 +27,11 @@ inline uint32_t loadLE32(const uint8_t *in) {
          static_cast<uint32_t>(in[3]) << 24;
 }
 
+inline uint32_t loadBE32(const uint8_t *in) {
+  return static_cast<uint32_t>(in[0]) << 24 | static_cast<uint32_t>(in[1]) << 16 | static_cast<uint32_t>(in[2]) << 8 |
+         static_cast<uint32_t>(in[3]);
+}
+
 // Writes the 16-byte compression header (magic, type, logical size) at out.
 inline void storeDiskHeader(uint8_t *out, uint32_t compressionType, uint64_t uncompressedSize) {
   storeLE32(out, kDecmpfsMagic);

@@ -80,11 +80,25 @@ int compressOpenFile(CompressorContext *ctx, const char *path, FileHandle *fh, P
   }
   atomicAdd(&ctx->successCounts[compressedBy], 1u);
 
+  // Whatever moment the process dies at, readers must find the whole data: the compressed form
+  // is made durable, then the file is marked compressed (readers decompress it from then on),
+  // and only then does the data fork go. If the form cannot be made durable, or the file cannot
+  // be marked, it keeps its data fork, as after a failed truncation.
+  bool flagSet = false;
   if (ctx->truncateAndRestoreTimes) {
-    if (fh->truncate(fh, 0) == -1) PLZC_ERR("%s:%d: truncate %s: %s\n", fh->path, strerror(errno));
+    bool keepData = fh->sync && fh->sync(fh) == -1;
+    if (keepData) PLZC_ERR("%s:%d: fsync %s: %s\n", fh->path, strerror(errno));
+    if (ctx->setCompressedFlag) {
+      if (fh->chflags(fh, kCompressedFlag) == -1) {
+        PLZC_ERR("%s:%d: chflags %s: %s\n", fh->path, strerror(errno));
+        keepData = true;
+      }
+      flagSet = true;
+    }
+    if (!keepData && fh->truncate(fh, 0) == -1) PLZC_ERR("%s:%d: truncate %s: %s\n", fh->path, strerror(errno));
     if (fh->utimes(fh, times) == -1) PLZC_ERR("%s:%d: utimes %s: %s\n", fh->path, strerror(errno));
   }
-  if (ctx->setCompressedFlag && fh->chflags(fh, kCompressedFlag) == -1)
+  if (ctx->setCompressedFlag && !flagSet && fh->chflags(fh, kCompressedFlag) == -1)
     PLZC_ERR("%s:%d: chflags %s: %s\n", fh->path, strerror(errno));
   if (ctx->verifyChecksums) {
     if (!checksumFile(path, after)) {

@@ -190,6 +190,21 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
                errno);
       return fail();
     }
+    // Whatever moment the process dies at, a reader must find the whole data: in the
+    // compressed form while the file is marked compressed, in the data fork from the moment it
+    // is not. So the data is made durable, then the file's own flags (without the compressed
+    // flag) are set, and only then the compressed form is removed.
+    if (fh->sync(fh) == -1) {
+      PLZC_ERR("%s:%d: Error: Failed to flush the data of file at path '%s': %s (%d)\n", path, strerror(errno),
+               errno);
+      return fail();
+    }
+    if (fh->chflags(fh, initial.st_flags & ~kCompressedFlag) != 0) {
+      PLZC_ERR("%s:%d: Error: Failed to set flags of compressed file at path '%s': %s (%d)\n", path,
+               strerror(errno), errno);
+      return fail();
+    }
+    restoreFlags = false;
     for (const char *name : {kDecmpfsXattrName, kResourceForkXattrName}) {
       if (fh->removexattr(fh, name, 0) == -1 && !(name == kResourceForkXattrName && errno == ENOATTR)) {
         PLZC_ERR("%s:%d: Error: Failed to remove %s xattr of file at path '%s': %s (%d)\n", name, path,
@@ -197,7 +212,6 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
         return fail();
       }
     }
-    restoreFlags = true;
   }
   struct timespec times[2] = {initial.st.st_atim, initial.st.st_mtim};
   struct timeval microTimes[2] = {toTimeval(initial.st.st_atim), toTimeval(initial.st.st_mtim)};

@@ -377,6 +377,7 @@ TEST_F(StreamCompressor, InPlaceFailuresLeaveTheFileAsItWas) {
     const char *message;
   } cases[] = {
       {"truncation", sys::Call::Truncate, 1, "Error: ftruncate failed for "},
+      {"flush", sys::Call::Fsync, 1, "Error: fsync failed for "},
       {"lock", sys::Call::Fstat, 1, "Error: PLZCLockFile failed for "},
       {"status", sys::Call::Fstat, 2, "Error: stat failed for "},
   };
@@ -401,6 +402,28 @@ TEST_F(StreamCompressor, InPlaceFailuresLeaveTheFileAsItWas) {
     EXPECT_EQ(readFile(path), text);  // the data fork is intact
     EXPECT_EQ(flagsOf(path), 0u);     // and the file is not marked compressed
   }
+}
+
+TEST_F(StreamCompressor, InPlaceFileWithItsOwnResourceForkIsNeverTakenApart) {
+  // Its end state is the file as it was: the fork is never taken off it, nor the data fork
+  // truncated, at any moment of the write-out.
+  std::vector<uint8_t> text = compressibleBytes(400000, 17), fork = randomBytes(100000, 18);
+  std::string path = writeFile(dir.file("forked"), text);
+  ASSERT_EQ(platform::setxattr(path.c_str(), kResourceForkXattrName, fork.data(), fork.size(), 0, 0), 0);
+  std::vector<std::string> namesBefore = linuxAttributeNames(path);
+  StreamCompressorQueue *queue = CreateCompressionQueue(nullptr, nullptr, nullptr, nullptr, nullptr);
+  uint64_t removals = sys::callCount(sys::Call::Fremovexattr), truncations = sys::callCount(sys::Call::Truncate);
+  EXPECT_EQ(CompressFile(queue, path.c_str(), nullptr), 1);
+  EXPECT_EQ(FinishStreamCompressorQueue(queue), 0);
+  EXPECT_EQ(sys::callCount(sys::Call::Fremovexattr), removals);
+  EXPECT_EQ(sys::callCount(sys::Call::Truncate), truncations);
+  EXPECT_EQ(readFile(path), text);
+  EXPECT_EQ(flagsOf(path), 0u);
+  EXPECT_EQ(linuxAttributeNames(path), namesBefore);
+  std::vector<uint8_t> back(fork.size());
+  EXPECT_EQ(platform::getxattr(path.c_str(), kResourceForkXattrName, back.data(), back.size(), 0, 0),
+            static_cast<ssize_t>(fork.size()));
+  EXPECT_EQ(back, fork);
 }
 
 TEST_F(StreamCompressor, InPlaceAttributesThatCannotBeStoredLeaveTheFileAlone) {

@@ -74,7 +74,7 @@ Counts runChecked(const std::function<void(FaultWindow &)> &run, const Fault *fa
 const char *callName(sys::Call call) {
   static const char *const kNames[] = {
       "open",     "close",     "read",      "write",        "pread",        "pwrite",       "ftruncate",
-      "truncate", "stat",      "lstat",     "fstat",        "statfs",       "fstatfs",      "getxattr",
+      "truncate", "fsync",     "stat",      "lstat",     "fstat",        "statfs",       "fstatfs",      "getxattr",
       "lgetxattr", "fgetxattr", "setxattr", "lsetxattr",    "fsetxattr",    "removexattr",  "lremovexattr",
       "fremovexattr", "listxattr", "llistxattr", "flistxattr", "futimes", "rename", "mkdir",
       "realpath", "malloc",    "calloc",    "dup",          "lseek",        "chmod",        "utimes",
@@ -112,6 +112,8 @@ std::vector<int> plausibleErrors(sys::Call call) {
     case Call::Pwrite: return {ENOSPC, EIO, EINTR};
     case Call::Ftruncate:
     case Call::Truncate: return {EIO, EINTR};
+    // Writing back delayed data may find the disk full.
+    case Call::Fsync: return {EIO, ENOSPC, EINTR};
     case Call::Stat:
     case Call::Lstat:
     case Call::Fstat:

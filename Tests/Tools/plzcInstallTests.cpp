@@ -19,6 +19,7 @@
 #include <map>
 #include <set>
 #include <sstream>
+#include <thread>
 
 #include "Libraries/CompressData/DiskHeader.h"
 #include "Platform/ExtendedAttributes.h"
@@ -113,6 +114,66 @@ TEST(PlzcInstall, CopiesATreeCompressedByTheRules) {
     EXPECT_EQ(isCompressed(path), source.compressed.count(relative) == 1) << relative;
     EXPECT_EQ(lstatOf(path).st_mode & 07777, lstatOf(source.root + "/" + relative).st_mode & 07777) << relative;
   }
+  // Every new file took its name: no unfinished copy is left behind.
+  for (const auto &entry : std::filesystem::recursive_directory_iterator(dest))
+    EXPECT_THAT(entry.path().filename().string(), Not(StartsWith(".plzc-install-"))) << entry.path();
+}
+
+TEST(PlzcInstall, APlainSourceKeepsItsOwnResourceFork) {
+  ScratchDir dir;
+  std::vector<uint8_t> text = compressibleBytes(300 << 10, 20), fork = randomBytes(100 << 10, 21);
+  std::string source = writeFile(dir.file("forked.txt"), text);
+  ASSERT_EQ(platform::setxattr(source.c_str(), kResourceForkXattrName, fork.data(), fork.size(), 0, 0), 0);
+  std::string dest = dir.file("copy.txt");
+  Finished run = plzc({"install", source, dest});
+  ASSERT_EQ(run.status, 0) << run.err;
+  EXPECT_FALSE(isCompressed(dest));  // a file with a fork of its own never ends compressed
+  EXPECT_EQ(readFile(dest), text);
+  std::vector<uint8_t> back(fork.size());
+  EXPECT_EQ(platform::getxattr(dest.c_str(), kResourceForkXattrName, back.data(), back.size(), 0, 0),
+            static_cast<ssize_t>(fork.size()));
+  EXPECT_EQ(back, fork);
+}
+
+// Killed at any moment, an install leaves under each destination name the old file or the
+// whole new one, never a part; its unfinished copies are reported by plzc repair.
+TEST(PlzcInstall, KilledInstallLeavesWholeFilesUnderDestinationNames) {
+  ScratchDir dir;
+  std::string source = dir.file("src"), dest = dir.file("dest");
+  mkdir(source.c_str(), 0755);
+  mkdir(dest.c_str(), 0755);
+  std::map<std::string, std::vector<uint8_t>> fresh, old;
+  for (int i = 0; i < 40; i++) {
+    std::string name = "f" + std::to_string(i);
+    fresh[name] = compressibleBytes((200 << 10) + static_cast<size_t>(i) * 1000, static_cast<uint32_t>(i));
+    old[name] = compressibleBytes(5000, static_cast<uint32_t>(100 + i));
+    writeFile(source + "/" + name, fresh[name]);
+    writeFile(dest + "/" + name, old[name]);
+  }
+  auto start = std::chrono::steady_clock::now();
+  ASSERT_EQ(plzc({"install", source + "/.", dir.file("timed")}).status, 0);
+  auto whole = std::chrono::steady_clock::now() - start;
+  int replaced = 0;
+  for (int round = 0; round < 3; round++) {
+    Process process({"install", "-j", "2", source + "/.", dest});
+    std::this_thread::sleep_for(whole * (round + 1) / 4);
+    process.signal(SIGKILL);
+    process.wait();
+    for (const auto &[name, bytes] : fresh) {
+      std::vector<uint8_t> now = catBytes(dest + "/" + name);
+      EXPECT_TRUE(now == bytes || now == old[name]) << name << " holds " << now.size() << " bytes";
+      replaced += now == bytes;
+    }
+    Finished repair = plzc({"repair", dest});
+    for (const auto &entry : std::filesystem::directory_iterator(dest)) {
+      std::string name = entry.path().filename().string();
+      if (name.compare(0, 14, ".plzc-install-") == 0) {
+        EXPECT_THAT(repair.out, HasSubstr(entry.path().string() + ": an unfinished copy of an interrupted plzc install"));
+        std::filesystem::remove(entry.path());
+      }
+    }
+  }
+  RecordProperty("files_replaced", replaced);
 }
 
 TEST(PlzcInstall, KeepsLinksModesAndTimes) {

@@ -120,14 +120,14 @@ TEST_F(Plzc, HelpAndVersionGoToStandardOutput) {
   Finished help = plzc({"--help"});
   EXPECT_EQ(help.status, 0);
   EXPECT_EQ(help.err, "");
-  for (const char *command : {"compress", "decompress", "cat", "info", "volume", "toc list", "demo"})
+  for (const char *command : {"compress", "decompress", "repair", "cat", "info", "volume", "toc list", "demo"})
     EXPECT_THAT(help.out, HasSubstr(std::string("\n  ") + command)) << command;
 
   Finished version = plzc({"--version"});
   EXPECT_EQ(version.status, 0);
   EXPECT_THAT(version.out, StartsWith("plzc (Plenzo) "));
 
-  for (const char *command : {"compress", "decompress", "cat", "info", "volume", "toc", "demo"}) {
+  for (const char *command : {"compress", "decompress", "repair", "cat", "info", "volume", "toc", "demo"}) {
     Finished run = plzc({command, "--help"});
     EXPECT_EQ(run.status, 0) << command;
     EXPECT_THAT(run.out, AllOf(StartsWith("Usage: plzc " + std::string(command)), HasSubstr("Exit status"))) << command;
@@ -158,6 +158,9 @@ TEST_F(Plzc, BadCommandLinesExitWithStatusTwoAndAHint) {
       {{"compress"}, "plzc compress: missing PATH"},
       {{"decompress", "--kernel", "x"}, "plzc decompress: unknown option '--kernel'"},
       {{"cat"}, "plzc cat: missing PATH"},
+      {{"repair"}, "plzc repair: missing PATH"},
+      {{"repair", "-j", "0", "x"}, "plzc repair: invalid number of jobs '0'"},
+      {{"repair", "--force", "x"}, "plzc repair: unknown option '--force'"},
       {{"info", "-x", "x"}, "plzc info: unknown option '-x'"},
       {{"volume"}, "plzc volume: missing PATH"},
       {{"toc"}, "plzc toc: missing action"},
@@ -670,6 +673,94 @@ TEST_F(Plzc, InterruptStopsBetweenFilesAndLeavesEveryFileWhole) {
   }
   EXPECT_GT(compressed, 0u);
   EXPECT_LT(compressed, files.size());
+}
+
+// ---- plzc repair ------------------------------------------------------------------------------
+
+// Lines of standard output that report a file (all but the summary), by path.
+std::map<std::string, std::string> reportedFiles(const std::string &out) {
+  std::map<std::string, std::string> lines;
+  std::istringstream text(out);
+  for (std::string line; std::getline(text, line);)
+    if (line.compare(0, 13, "plzc repair: ") != 0) lines[line.substr(0, line.find(": "))] = line;
+  return lines;
+}
+
+TEST_F(Plzc, RepairReportsEachHalfDoneFileAndMakesItWhole) {
+  Tree tree = makeTree(dir, "tree");
+  ASSERT_EQ(plzc({"compress", tree.root}).status, 0);
+  // A compression stopped before the flag, a decompression stopped after 1000 bytes, a file
+  // whose data cannot be proven, and the unfinished copy of an interrupted install.
+  std::string rolledForward = tree.path("docs/small.txt"), cutShort = tree.path("docs/guide.txt");
+  ASSERT_EQ(platform::chflags(rolledForward.c_str(), 0), 0);
+  std::vector<uint8_t> guide = tree.files["docs/guide.txt"];
+  int fd = open(cutShort.c_str(), O_WRONLY);
+  ASSERT_EQ(pwrite(fd, guide.data(), 1000, 0), 1000);
+  close(fd);
+  std::string unprovable = writeFile(tree.path("data/flagged"), textBytes(5000, 6));
+  ASSERT_EQ(platform::chflags(unprovable.c_str(), kFlagCompressed), 0);
+  std::string unfinished = writeFile(tree.path("docs/.plzc-install-Ab12Cd"), textBytes(100, 7));
+
+  Finished dry = plzc({"repair", "--dry-run", tree.root});
+  EXPECT_EQ(dry.status, 1) << dry.err;
+  std::map<std::string, std::string> would = reportedFiles(dry.out);
+  EXPECT_EQ(would.size(), 4u) << dry.out;
+  EXPECT_THAT(would[rolledForward], HasSubstr(": would mark it compressed"));
+  EXPECT_EQ(readFile(cutShort).size(), 1000u);  // nothing changed
+  EXPECT_THAT(dry.out, HasSubstr("2 to repair, 1 left alone, 0 failed, 1 unfinished install copies\n"));
+
+  Finished run = plzc({"repair", tree.root});
+  EXPECT_EQ(run.status, 1) << run.err;
+  std::map<std::string, std::string> lines = reportedFiles(run.out);
+  EXPECT_EQ(lines[rolledForward], rolledForward +
+                                      ": a whole compressed form beside an empty data fork, not marked compressed: "
+                                      "marked compressed");
+  EXPECT_EQ(lines[cutShort], cutShort + ": a decompression cut short: 1000 of " + std::to_string(guide.size()) +
+                                 " bytes in the data fork: decompression finished: data written, compressed form "
+                                 "removed");
+  EXPECT_THAT(lines[unprovable], HasSubstr(": left alone: cannot be proven: "));
+  EXPECT_THAT(lines[unfinished], HasSubstr(": an unfinished copy of an interrupted plzc install: left alone"));
+  // Five files of the tree (one with two names), and the two added.
+  EXPECT_THAT(run.out, HasSubstr("plzc repair: 7 files in "));
+  EXPECT_THAT(run.out, HasSubstr(": 3 clean, 2 repaired, 1 left alone, 0 failed, 1 unfinished install copies\n"));
+  EXPECT_EQ(run.err, "");
+  EXPECT_TRUE(isCompressed(rolledForward));
+  EXPECT_FALSE(isCompressed(cutShort));
+  EXPECT_EQ(readFile(cutShort), guide);
+  for (const auto &[relative, bytes] : tree.files) EXPECT_EQ(bytesOf(plzc({"cat", tree.path(relative)}).out), bytes) << relative;
+
+  // What was left alone is all that remains; without it everything is clean.
+  unlink(unprovable.c_str());
+  unlink(unfinished.c_str());
+  Finished again = plzc({"repair", "-v", tree.root});
+  EXPECT_EQ(again.status, 0) << again.out;
+  EXPECT_THAT(again.out, HasSubstr(tree.path("docs/guide.txt") + ": clean\n"));
+  EXPECT_THAT(again.out, HasSubstr(": 5 clean, 0 repaired, 0 left alone, 0 failed\n"));
+  // A missing path fails the run by name.
+  Finished missing = plzc({"repair", dir.file("absent")});
+  EXPECT_EQ(missing.status, 1);
+  EXPECT_THAT(missing.err, HasSubstr(dir.file("absent") + ": No such file or directory"));
+}
+
+TEST_F(Plzc, RepairAfterAKilledCompressionFindsEveryFileWhole) {
+  std::string root = dir.file("tree");
+  mkdir(root.c_str(), 0755);
+  std::map<std::string, std::vector<uint8_t>> files;
+  for (int i = 0; i < 60; i++) {
+    std::string path = root + "/f" + std::to_string(i);
+    files[path] = textBytes((256 << 10) + static_cast<size_t>(i) * 4099, static_cast<uint32_t>(i));
+    writeFile(path, files[path]);
+  }
+  Process process({"compress", "-v", "-j", "2", root});
+  ASSERT_TRUE(process.waitForErr(": type 4", std::chrono::seconds(60)));
+  process.signal(SIGKILL);
+  EXPECT_EQ(process.wait().status, 128 + SIGKILL);
+  Finished repair = plzc({"repair", root});
+  EXPECT_EQ(repair.status, 0) << repair.out << repair.err;
+  for (const auto &[path, bytes] : files) EXPECT_EQ(bytesOf(plzc({"cat", path}).out), bytes) << path;
+  // What repair left, compress finishes.
+  EXPECT_EQ(plzc({"compress", root}).status, 0);
+  for (const auto &[path, bytes] : files) EXPECT_TRUE(isCompressed(path)) << path;
 }
 
 // Runs plzc with a terminal as its standard error (and output) and returns all it wrote there.

@@ -82,12 +82,16 @@ void printHelp() {
       "far as permitted) and extended attributes are kept, as 'cp -a' keeps them; file flags are\n"
       "not copied. Symbolic links among SRC are copied as links, not followed. Compressed sources\n"
       "are read through the library. Files whose names begin with '._' are copied as they are.\n"
-      "An existing file at a destination path is replaced by a new file.\n"
+      "An existing file at a destination path is replaced by a new file. Each new file is written\n"
+      "under a temporary name (%s...) beside its destination and takes its name once it\n"
+      "is whole, so an interrupted install leaves no partial file under a destination's name;\n"
+      "'plzc repair' lists the temporary files it left.\n"
       "\n"
       "Exit status: 0 when everything was copied, 1 when a file failed or the pipeline's finish\n"
       "failed (the files named in its messages are listed), 2 on a usage error or an unusable\n"
       "--options or --rules file, 130 when interrupted.\n",
-      indentedEngineHelp(kEngineHelp).c_str(), indentedEngineHelp(kFastHelp).c_str(), availableProcessors());
+      indentedEngineHelp(kEngineHelp).c_str(), indentedEngineHelp(kFastHelp).c_str(), availableProcessors(),
+      kUnfinishedInstallPrefix);
 }
 
 }  // namespace

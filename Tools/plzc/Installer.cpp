@@ -31,6 +31,8 @@
 
 namespace plzc {
 
+const char kUnfinishedInstallPrefix[] = ".plzc-install-";
+
 namespace {
 
 constexpr size_t kPieceBytes = 1 << 20;  // bytes read from a source and written to its stream at once
@@ -82,8 +84,9 @@ bool setOwnerAndMode(int fd, const struct stat &st, std::string *cause) {
   return true;
 }
 
-// The file's own attributes, not the compressed form's: the pipeline writes those itself.
-bool copyAttributes(int in, int out, std::string *cause) {
+// The file's own attributes, not the compressed form's: the pipeline writes those itself. A
+// plain source's resource fork is its own and is copied.
+bool copyAttributes(int in, int out, bool compressed, std::string *cause) {
   ssize_t listSize = platform::flistxattr(in, nullptr, 0, 0);
   if (listSize <= 0) return true;  // none, or the source cannot have any
   std::string names(static_cast<size_t>(listSize), '\0');
@@ -94,7 +97,7 @@ bool copyAttributes(int in, int out, std::string *cause) {
   for (size_t at = 0; at < names.size();) {
     std::string name = names.c_str() + at;
     at += name.size() + 1;
-    if (name.empty() || name == kDecmpfsXattrName || name == kResourceForkXattrName) continue;
+    if (name.empty() || name == kDecmpfsXattrName || (compressed && name == kResourceForkXattrName)) continue;
     ssize_t size = platform::fgetxattr(in, name.c_str(), nullptr, 0, 0, 0);
     if (size < 0) continue;  // gone meanwhile
     value.resize(static_cast<size_t>(size) + 1);
@@ -189,7 +192,7 @@ class Installer {
     copy(source, dest, st);
   }
 
-  // Every source walked: waits for the feeding threads, then makes the hard links found.
+  // Every source walked: waits for the feeding threads.
   uint64_t finishWalk() {
     {
       std::lock_guard<std::mutex> guard(lock_);
@@ -197,6 +200,19 @@ class Installer {
     }
     haveWork_.notify_all();
     for (std::thread &worker : workers_) worker.join();
+    return filesQueued_;
+  }
+
+  // Once the pipeline has written every file: each takes its destination's name (replacing
+  // what was there), then the hard links found are made to them.
+  void publish() {
+    for (const auto &[temporary, dest] : pendingRenames_) {
+      if (rename(temporary.c_str(), dest.c_str()) != 0) {
+        fail(dest, std::string("cannot move the new file into place: ") + strerror(errno));
+        unlink(temporary.c_str());
+      }
+    }
+    pendingRenames_.clear();
     for (const auto &[dest, first] : pendingLinks_) {
       if (!removeExisting(dest)) continue;
       if (link(first.c_str(), dest.c_str()) != 0) {
@@ -205,7 +221,6 @@ class Installer {
       }
       hardLinks_++;
     }
-    return filesQueued_;
   }
 
   // Once the pipeline has written every file: directory modes and times, deepest first, since
@@ -382,19 +397,28 @@ class Installer {
     }
   }
 
-  // A new destination file, owner-writable, open for reading and writing.
-  int createDestination(const std::string &dest) {
-    for (int attempt = 0; attempt < 2; attempt++) {
-      int fd = open(dest.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
-      if (fd >= 0 || errno != EEXIST || attempt == 1) return fd;
-      // An earlier file there is replaced by a new one, never rewritten in place: its
-      // attributes and flags must not survive.
-      if (!removeExisting(dest)) {
-        errno = EEXIST;
-        return -1;
-      }
+  // A new file beside dest under a temporary name (*temporary), owner-writable, open for
+  // reading and writing. An earlier file at dest is replaced by it later, never rewritten in
+  // place: its attributes and flags must not survive.
+  int createTemporary(const std::string &dest, std::string *temporary, std::string *cause) {
+    struct stat existing;
+    if (lstat(dest.c_str(), &existing) == 0 && S_ISDIR(existing.st_mode)) {
+      *cause = "exists and is a directory";
+      return -1;
     }
-    return -1;
+    std::string name = joinPath(parentOf(dest), std::string(kUnfinishedInstallPrefix) + "XXXXXX");
+    int fd = mkostemp(name.data(), O_CLOEXEC);
+    if (fd < 0) {
+      *cause = strerror(errno);
+      return -1;
+    }
+    *temporary = name;
+    return fd;
+  }
+
+  void renameLater(const std::string &temporary, const std::string &dest) {
+    std::lock_guard<std::mutex> guard(resultsLock_);
+    pendingRenames_.emplace_back(temporary, dest);
   }
 
   void installFile(const FileJob &job, std::vector<char> &buffer) {
@@ -413,14 +437,13 @@ class Installer {
       size = info.uncompressedSize;
     }
 
-    int out = createDestination(job.dest);
+    std::string temporary, cause;
+    int out = createTemporary(job.dest, &temporary, &cause);
     if (out < 0) {
-      int error = errno;
       close(in);
-      return fail(job.dest, strerror(error));
+      return fail(job.dest, cause);
     }
-    std::string cause;
-    bool ok = setOwnerAndMode(out, job.st, &cause) && copyAttributes(in, out, &cause);
+    bool ok = setOwnerAndMode(out, job.st, &cause) && copyAttributes(in, out, compressed, &cause);
     // The pipeline's write-out keeps the times the file has when it begins: the source's.
     timespec times[2] = {job.st.st_atim, job.st.st_mtim};
     if (ok && futimens(out, times) != 0) {
@@ -428,6 +451,7 @@ class Installer {
       ok = false;
     }
     int64_t fed = -1;
+    bool streamed = false;
     if (ok && lastComponent(job.dest).compare(0, 2, "._") == 0) {
       // The pipeline takes no part in these files: copied as they are.
       fed = feedData(in, source, compressed, size, buffer,
@@ -438,10 +462,19 @@ class Installer {
       }
       if (fed >= 0) plainCopies_++;
     } else if (ok) {
-      fed = streamFile(job, in, out, compressed, size, buffer, &cause);
+      fed = streamFile(job, in, out, compressed, size, buffer, &streamed, &cause);
     }
     close(out);
     close(in);
+    // Written by this thread: it takes its name now. Streamed: once the pipeline is done with
+    // it. A failed file takes its name too, as it is, like the partial file of any copier.
+    if (streamed) {
+      renameLater(temporary, job.dest);
+    } else if (rename(temporary.c_str(), job.dest.c_str()) != 0) {
+      if (fed >= 0) cause = std::string("cannot move the new file into place: ") + strerror(errno);
+      fed = -1;
+      unlink(temporary.c_str());
+    }
     if (fed < 0) return fail(job.dest, cause);
     if (static_cast<uint64_t>(fed) != size) return fail(job.source, "changed size while being copied");
     {
@@ -453,14 +486,17 @@ class Installer {
     progress_.fileDone(size);
   }
 
+  // Feeds the source to a new stream on out; *streamed tells whether the pipeline took the file
+  // (and so writes it later).
   int64_t streamFile(const FileJob &job, int in, int out, bool compressed, uint64_t size, std::vector<char> &buffer,
-                     std::string *cause) {
+                     bool *streamed, std::string *cause) {
     StreamCompressor *stream =
         CreateStreamCompressor(out, job.dest.c_str(), root_.c_str(), queue_, static_cast<int64_t>(size));
     if (!stream) {
       *cause = std::string("the pipeline did not take the file") + (errno ? ": " : "") + (errno ? strerror(errno) : "");
       return -1;
     }
+    *streamed = true;
     {
       std::lock_guard<std::mutex> guard(resultsLock_);
       streamed_.push_back(job.dest);
@@ -496,6 +532,7 @@ class Installer {
   std::set<InodeKey> made_;
   std::map<InodeKey, std::string> firstLinks_;
   std::vector<std::pair<std::string, std::string>> pendingLinks_;  // (new link, first path)
+  std::vector<std::pair<std::string, std::string>> pendingRenames_;  // (temporary, destination)
   uint64_t filesQueued_ = 0, symlinks_ = 0, hardLinks_ = 0, specials_ = 0;
 
   std::mutex lock_;
@@ -551,6 +588,7 @@ InstallResult runInstall(const std::vector<std::string> &sources, const std::str
   result.itemsQueued = counts.enqueued;
   result.itemsStarted = counts.started;
   result.itemsCompleted = counts.completed;
+  installer.publish();
   installer.fixDirectories();
   result.seconds = progress.elapsedSeconds();
   tap.stop();

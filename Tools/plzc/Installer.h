@@ -11,6 +11,11 @@
 
 namespace plzc {
 
+// Every new file is written under a temporary name of this prefix beside its destination and
+// renamed to the destination once the pipeline has written it whole: an interrupted install
+// leaves no partial file under a destination's name, only these.
+extern const char kUnfinishedInstallPrefix[];
+
 struct InstallResult {
   Totals totals;                        // regular files; with verbose, how they were stored
   uint64_t directories = 0, symlinks = 0, hardLinks = 0, plainCopies = 0, specials = 0;

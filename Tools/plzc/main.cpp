@@ -20,7 +20,7 @@ struct Subcommand {
 const Subcommand kSubcommands[] = {
     {"compress", plzc::compressCommand}, {"decompress", plzc::decompressCommand}, {"cat", plzc::catCommand},
     {"info", plzc::infoCommand},         {"volume", plzc::volumeCommand},         {"toc", plzc::tocCommand},
-    {"demo", plzc::demoCommand},         {"install", plzc::installCommand},
+    {"demo", plzc::demoCommand},         {"install", plzc::installCommand},       {"repair", plzc::repairCommand},
 };
 
 void printHelp() {
@@ -38,6 +38,7 @@ void printHelp() {
       "                        copy files and trees to DEST as new files, compressed on the way\n"
       "  decompress [--verify] [--user-space] PATH...\n"
       "                        turn compressed files back into plain files\n"
+      "  repair [-n] PATH...   find files a crash left half-done and make each whole again\n"
       "  cat PATH...           write the files' data to standard output\n"
       "  info [-r] PATH...     type, logical size, stored size and ratio of files; with -r, a\n"
       "                        summary of each tree\n"

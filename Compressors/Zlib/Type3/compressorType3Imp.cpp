@@ -112,3 +112,8 @@ int64_t doUncompressType3(FileHandle *handle, int64_t offset, uint64_t size, uin
   state.attribute = attribute;
   return chunkingDecompressor(offset, size, vectorCount, vectors, kType3ChunkSize, 0, 0, &state, supplyChunkType3);
 }
+
+int64_t decodeAttributeType3(const uint8_t *attribute, uint32_t length, uint8_t *out) {
+  if (length <= kDiskHeaderSize || length > kMaxType3AttributeSize) return -1;
+  return decodeWholeChunk(attribute + kDiskHeaderSize, length - kDiskHeaderSize, out, kType3ChunkSize);
+}

@@ -16,6 +16,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <vector>
 
 #include "Common/Diagnostics.h"
 #include "Common/commonUtils.h"
@@ -301,4 +302,59 @@ int64_t doUncompressType4(FileHandle *handle, int64_t offset, uint64_t size, uin
                                         supplyChunkType4);
   if (result == -1) PLZC_ERR("%s:%d: chunkingDecompressor %s: %s\n", handle->path, strerror(errno));
   return result;
+}
+
+int readForkShapeType4(FileHandle *handle, Type4ForkShape *shape) {
+  int options = forkReadOptions();
+  int64_t forkSize = handle->getxattr(handle, kResourceForkXattrName, nullptr, 0, 0, options);
+  uint8_t head[kDataStart + 4];
+  if (forkSize < static_cast<int64_t>(sizeof head) ||
+      handle->getxattr(handle, kResourceForkXattrName, head, sizeof head, 0, options) != static_cast<int64_t>(sizeof head))
+    return -1;
+  shape->chunkCount = plzc::loadLE32(head + kDataStart);
+  if (shape->chunkCount == 0) return -1;
+  if (std::all_of(head, head + kDataStart, [](uint8_t byte) { return byte == 0; })) {
+    shape->finished = false;
+    return 0;
+  }
+  uint32_t dataLength = plzc::loadBE32(head + kResourceDataOffset);
+  uint8_t expected[kResourceDataOffset] = {};
+  plzc::storeBE32(expected, kResourceDataOffset);
+  plzc::storeBE32(expected + 4, kDataStart + dataLength);
+  plzc::storeBE32(expected + 8, dataLength + 4);
+  plzc::storeBE32(expected + 12, kMapLength);
+  if (memcmp(head, expected, sizeof expected) != 0) return -1;
+  // The head is written just before the map: a fork that ends where the map goes is unfinished.
+  if (forkSize == kDataStart + static_cast<int64_t>(dataLength)) {
+    shape->finished = false;
+    return 0;
+  }
+  uint8_t map[kMapLength];
+  if (forkSize != kForkOverhead + dataLength ||
+      handle->getxattr(handle, kResourceForkXattrName, map, sizeof map, kDataStart + dataLength, options) !=
+          static_cast<int64_t>(sizeof map) ||
+      memcmp(map, kDataSuffix, sizeof map) != 0)
+    return -1;
+  shape->finished = true;
+  return 0;
+}
+
+int64_t decodeChunkType4(FileHandle *handle, uint32_t index, uint8_t *out) {
+  int options = forkReadOptions();
+  uint64_t entryPosition = kDataStart + 4 + static_cast<uint64_t>(kTableEntrySize) * index;
+  if (entryPosition > 0xFFFFFFFFULL - kTableEntrySize) return -1;
+  uint8_t entry[kTableEntrySize];
+  int64_t got = handle->getxattr(handle, kResourceForkXattrName, entry, sizeof entry,
+                                 static_cast<uint32_t>(entryPosition), options);
+  if (got == 0) return 0;
+  if (got != static_cast<int64_t>(sizeof entry)) return -1;
+  uint32_t chunkOffset = plzc::loadLE32(entry), chunkLength = plzc::loadLE32(entry + 4);
+  if (chunkOffset == 0 && chunkLength == 0) return 0;
+  uint64_t chunkPosition = static_cast<uint64_t>(kDataStart) + chunkOffset;
+  if (chunkLength == 0 || chunkLength > kType4ChunkSize + 1 || chunkPosition > 0xFFFFFFFFULL) return -1;
+  std::vector<uint8_t> chunk(chunkLength);
+  got = handle->getxattr(handle, kResourceForkXattrName, chunk.data(), chunkLength,
+                         static_cast<uint32_t>(chunkPosition), options);
+  if (got != static_cast<int64_t>(chunkLength)) return -1;
+  return decodeWholeChunk(chunk.data(), chunkLength, out, kType4ChunkSize);
 }

@@ -16,6 +16,7 @@
 #include "Libraries/CompressData/DiskHeader.h"
 #include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
+#include "Platform/Syscalls.h"
 #include "Plenzo.h"
 #include "Support/TestSupport.h"
 
@@ -222,6 +223,53 @@ TEST_F(CompressData, VerifiedCompressionReplacesOtherFlagsWithTheCompressedFlag)
   EXPECT_EQ(memcmp(digest, expected, 16), 0);
   EXPECT_EQ(checksumFile(dir.file("missing").c_str(), digest), 0);
   freeCompressor(ctx);
+}
+
+// Whichever in-place step fails after the compressed form is written, every reader still gets
+// the whole data: the form is made durable and the file marked compressed before its data fork
+// goes; a failed flush or truncation leaves a compressed file whose data fork is still full, a
+// failed flag a plain file beside its compressed form.
+TEST_F(CompressData, InPlaceStepThatFailsLeavesAFileThatReadsWhole) {
+  struct Case {
+    const char *name;
+    sys::Call call;
+    uint32_t flags;        // after the call
+    bool dataForkKept;
+    const char *message;
+  } cases[] = {
+      {"flush", sys::Call::Fsync, kCompressedFlag, true, "fsync "},
+      {"truncation", sys::Call::Truncate, kCompressedFlag, true, "truncate "},
+      {"flag", sys::Call::Fsetxattr, 0, true, "chflags "},
+  };
+  std::vector<uint8_t> text = compressibleBytes(300000, 20);
+  for (const Case &c : cases) {
+    SCOPED_TRACE(c.name);
+    CompressorContext *ctx = initCompressor("4", nullptr, nullptr, nullptr, false, 5, false);
+    std::string path = writeFile(dir.file(c.name), text);
+    // Armed for the step after the compressor: its own calls of that kind come first.
+    uint64_t header = sys::callCount(c.call);
+    CompressorContext *twin = initCompressor("4", nullptr, nullptr, nullptr, false, 5, false);
+    std::string twinPath = writeFile(dir.file(std::string(c.name) + ".twin"), text);
+    ASSERT_EQ(compressFile(twin, twinPath.c_str(), nullptr), 0);
+    freeCompressor(twin);
+    uint64_t perRun = sys::callCount(c.call) - header;
+    uint64_t nth = c.call == sys::Call::Fsetxattr ? perRun : 1;  // the flag word is the last fsetxattr
+    CaptureStderr();
+    sys::armFault(c.call, nth, EIO);
+    EXPECT_EQ(compressFile(ctx, path.c_str(), nullptr), 0);  // these failures do not change the result
+    sys::clearFaults();
+    EXPECT_THAT(GetCapturedStderr(), HasSubstr(std::string(c.message) + path + ": Input/output error"));
+    platform::Stat st;
+    ASSERT_EQ(platform::stat(path.c_str(), &st), 0);
+    EXPECT_EQ(st.st_flags, c.flags);
+    EXPECT_EQ(readFile(path).size(), c.dataForkKept ? text.size() : 0u);
+    if (c.flags & kCompressedFlag) {
+      EXPECT_EQ(logicalData(path), text);
+    } else {
+      EXPECT_EQ(readFile(path), text);
+    }
+    freeCompressor(ctx);
+  }
 }
 
 // Parses a table-of-contents file into path -> (name -> bytes), failing on any malformed record.

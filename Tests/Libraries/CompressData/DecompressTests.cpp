@@ -1,5 +1,6 @@
 #include <fcntl.h>
 #include <grp.h>
+#include <md5.h>
 #include <sys/mman.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -542,11 +543,12 @@ TEST_P(DecompressFileFailure, PrintsTheFailedStepLast) {
 }
 
 // Call counts follow the steps: once the file is open, everything goes through its descriptor:
-// a flag word is set with fsetxattr and cleared with fremovexattr, the last of a run; the
-// header's plain name, its index, then the fork's plain name are removed; times are set with
-// futimens (counted as futimes); stat is called once before and
-// once after, each followed by a getxattr of the flag word; with verify, the last open of a
-// run is the checksum after.
+// a flag word is set with fsetxattr and cleared with fremovexattr; once the data is written
+// and flushed, the file's own flags are set (the compressed flag cleared), which is the first
+// fremovexattr of a run on a file without other flags; then the header's plain name, its
+// index, then the fork's plain name are removed; times are set with futimens (counted as
+// futimes); stat is called once before and once after, each followed by a getxattr of the flag
+// word; with verify, the last open of a run is the checksum after.
 INSTANTIATE_TEST_SUITE_P(
     Steps, DecompressFileFailure,
     ::testing::Values(
@@ -558,22 +560,24 @@ INSTANTIATE_TEST_SUITE_P(
                   "Failed to open compressed file at path '%s' for writing: Permission denied \\(13\\)"},
         StepFault{"WriteData", false, 0, sys::Call::Pwrite, 2, ENOSPC,
                   "Failed to decompress data for file at path '%s': No space left on device \\(28\\)"},
-        StepFault{"RemoveHeader", false, 0, sys::Call::Fremovexattr, 1, EIO,
+        StepFault{"FlushData", false, 0, sys::Call::Fsync, 1, EIO,
+                  "Failed to flush the data of file at path '%s': Input/output error \\(5\\)"},
+        StepFault{"SetOtherFlags", false, kFlagHidden, sys::Call::Fsetxattr, 2, EPERM,
+                  "Failed to set flags of compressed file at path '%s': Operation not permitted \\(1\\)"},
+        StepFault{"ClearCompressedFlag", false, 0, sys::Call::Fremovexattr, 1, EPERM,
+                  "Failed to set flags of compressed file at path '%s': Operation not permitted \\(1\\)"},
+        StepFault{"RemoveHeader", false, 0, sys::Call::Fremovexattr, 2, EIO,
                   "Failed to remove com\\.tavix\\.decmpfs xattr of file at path '%s': Input/output error \\(5\\)"},
-        StepFault{"RemoveFork", false, 0, sys::Call::Fremovexattr, 3, EIO,
+        StepFault{"RemoveFork", false, 0, sys::Call::Fremovexattr, 4, EIO,
                   "Failed to remove com\\.tavix\\.ResourceFork xattr of file at path '%s': Input/output error "
                   "\\(5\\)"},
         StepFault{"RestoreTimes", false, 0, sys::Call::Futimes, 1, EPERM,
                   "Failed to restore timestamp of file at path '%s': Operation not permitted \\(1\\)"},
-        StepFault{"SetOtherFlags", false, kFlagHidden, sys::Call::Fsetxattr, 2, EPERM,
-                  "Failed to set flags of compressed file at path '%s': Operation not permitted \\(1\\)"},
-        StepFault{"ClearLastFlag", false, 0, sys::Call::Fremovexattr, 0, EPERM,
-                  "Failed to set flags of compressed file at path '%s': Operation not permitted \\(1\\)"},
         StepFault{"StatAfter", false, 0, sys::Call::Stat, 2, EIO,
                   "!\\? Stat failed for path '%s' after file should have decompressed\\. Input/output error "
                   "\\(5\\)"},
         // The flag word reported missing while it is there: chflags believes it cleared it.
-        StepFault{"StillCompressed", false, 0, sys::Call::Fremovexattr, 0, ENODATA,
+        StepFault{"StillCompressed", false, 0, sys::Call::Fremovexattr, 1, ENODATA,
                   "File '%s' was still compressed after attempting decompression\\."},
         // The flag word unreadable at the stat after: it reads as no flags at all.
         StepFault{"ChangedFlags", false, kFlagHidden, sys::Call::Getxattr, 0, EPERM,
@@ -581,6 +585,40 @@ INSTANTIATE_TEST_SUITE_P(
         StepFault{"ChecksumAfter", true, 0, sys::Call::Open, 0, EACCES,
                   "Unable to checksum file '%s' after decompression\\."}),
     [](const ::testing::TestParamInfo<StepFault> &info) { return std::string(info.param.name); });
+
+// A decompression that stops after writing the data, at any later step, leaves a file every
+// reader gets whole: still marked compressed until the data is durable, plain from then on.
+TEST_F(Decompress, StopAfterTheDataLeavesAFileThatReadsWhole) {
+  struct Case {
+    const char *name;
+    sys::Call call;
+    uint64_t nth;
+    bool stillCompressed;
+  } cases[] = {
+      {"flush", sys::Call::Fsync, 1, true},
+      {"flag", sys::Call::Fremovexattr, 1, true},
+      {"header", sys::Call::Fremovexattr, 2, false},
+      {"fork", sys::Call::Fremovexattr, 4, false},
+  };
+  std::string original = logText(300000, 9);
+  for (const Case &c : cases) {
+    SCOPED_TRACE(c.name);
+    std::string path = compressedFile(c.name, original.size(), 4, 9);
+    FdCapture quiet(2);
+    sys::armFault(c.call, c.nth, EIO);
+    EXPECT_EQ(decompressFile(path.c_str(), false, 0), -1);
+    sys::clearFaults();
+    quiet.text();
+    EXPECT_EQ((flagsOf(path) & kFlagCompressed) != 0, c.stillCompressed);
+    uint8_t digest[16], expected[16];
+    ASSERT_EQ(checksumFile(path.c_str(), digest), 1);
+    MD5_CTX md5;
+    MD5Init(&md5);
+    MD5Update(&md5, reinterpret_cast<const uint8_t *>(original.data()), original.size());
+    MD5Final(expected, &md5);
+    EXPECT_EQ(memcmp(digest, expected, 16), 0);
+  }
+}
 
 TEST_F(Decompress, MissingFileIsReportedWithoutItsPath) {
   FdCapture err(2);
