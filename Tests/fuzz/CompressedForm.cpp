@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cstring>
 
+#include "Common/ChunkEngine.h"
 #include "Common/DataPool.h"
 #include "Common/OverlayFile.h"
 #include "Libraries/CompressData/CompressData.h"
@@ -56,7 +57,9 @@ FileHandle *emptyBase() {
 
 }  // namespace
 
-Decoded decodeAndCheck(FileHandle *handle, const Bytes *header, uint64_t limit) {
+namespace {
+
+Decoded decodeOnce(FileHandle *handle, const Bytes *header, uint64_t limit) {
   Decoded decoded;
   WriterState state{&decoded, limit};
   decoded.result = decompressData(handle, checkingWriter, &state);
@@ -73,10 +76,8 @@ Decoded decodeAndCheck(FileHandle *handle, const Bytes *header, uint64_t limit) 
   return decoded;
 }
 
-int64_t readRange(FileHandle *handle, uint32_t type, const Bytes &header, uint64_t offset, uint64_t length,
-                  Bytes *out) {
-  const CompressorOps *row = compressorForReading(type);
-  if (!row) return -1;
+int64_t readRangeOnce(FileHandle *handle, const CompressorOps *row, const Bytes &header, uint64_t offset,
+                      uint64_t length, Bytes *out) {
   // The block decompressData hands over: the attribute's length, then the attribute.
   Bytes block(sizeof(uint32_t) + header.size());
   auto size = static_cast<uint32_t>(header.size());
@@ -89,6 +90,51 @@ int64_t readRange(FileHandle *handle, uint32_t type, const Bytes &header, uint64
              static_cast<unsigned long long>(length), static_cast<long long>(got));
   out->resize(got > 0 ? static_cast<size_t>(got) : 0);
   return got;
+}
+
+// The engines this build has besides zlib, each of which must read every input exactly as zlib
+// does: the same result, the same bytes.
+std::vector<ChunkEngine> otherEngines() {
+  std::vector<ChunkEngine> engines;
+  for (ChunkEngine engine : {ChunkEngine::Libdeflate, ChunkEngine::Isal}) {
+    if (chunkEngineBuilt(engine)) engines.push_back(engine);
+  }
+  return engines;
+}
+
+// Runs read once with zlib, then with every other engine, failing the run when one differs;
+// the engine in force before is put back.
+template <typename Read>
+auto onEveryEngine(const char *what, Read read) {
+  ChunkEngine before = currentChunkEngine();
+  setChunkEngine(ChunkEngine::Zlib);
+  auto reference = read();
+  for (ChunkEngine engine : otherEngines()) {
+    setChunkEngine(engine);
+    auto other = read();
+    FUZZ_CHECK(other == reference, "%s with %s differs from zlib's", what, chunkEngineName(engine));
+  }
+  setChunkEngine(before);
+  return reference;
+}
+
+}  // namespace
+
+Decoded decodeAndCheck(FileHandle *handle, const Bytes *header, uint64_t limit) {
+  return onEveryEngine("decompressData", [&] { return decodeOnce(handle, header, limit); });
+}
+
+int64_t readRange(FileHandle *handle, uint32_t type, const Bytes &header, uint64_t offset, uint64_t length,
+                  Bytes *out) {
+  const CompressorOps *row = compressorForReading(type);
+  if (!row) return -1;
+  auto result = onEveryEngine("the ranged read", [&] {
+    Bytes bytes;
+    int64_t got = readRangeOnce(handle, row, header, offset, length, &bytes);
+    return std::make_pair(got, bytes);
+  });
+  *out = result.second;
+  return result.first;
 }
 
 MemoryAttributes::MemoryAttributes() {

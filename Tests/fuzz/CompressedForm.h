@@ -20,8 +20,12 @@ struct Decoded {
   int result = -1;
   Bytes data;            // every piece, in order
   bool stopped = false;  // the writer refused a piece past the limit
+  bool operator==(const Decoded &) const = default;
 };
 
+// Both readers below run once with each engine this build has (zlib first) and fail the run
+// when an engine's result or bytes differ from zlib's.
+//
 // Runs decompressData on handle with a writer that checks every piece (each follows the last
 // without a gap and holds 1 to 131072 bytes) and keeps at most limit bytes. When header (the
 // "com.tavix.decmpfs" value, or NULL when unknown) holds a whole header, a success must have
