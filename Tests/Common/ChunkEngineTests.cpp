@@ -158,6 +158,37 @@ TEST_P(ChunkEngines, LevelsMeanTheSameOnEveryEngine) {
   EXPECT_EQ(code, Z_STREAM_ERROR);
 }
 
+// A chunk's stream depends on the chunk alone: not on what the encoder compressed before (a
+// pool thread's encoder sees files in any order) nor on the bytes after the chunk in its buffer.
+TEST_P(ChunkEngines, SameChunkGivesTheSameStreamWhateverCameBefore) {
+  if (!chunkEngineBuilt(GetParam())) GTEST_SKIP() << "engine not built";
+  Bytes text = compressibleBytes(kChunk, 21);
+  Bytes other = compressibleBytes(kChunk, 22);
+  Bytes noise = randomBytes(kChunk, 23);
+  for (int level : {1, 5, 9}) {
+    SCOPED_TRACE("level " + std::to_string(level));
+    auto encode = [&](ChunkEncoder &encoder, const Bytes &input, uint32_t count) {
+      Bytes out(kChunk + 64);
+      uint32_t produced = 0;
+      int code = 0;
+      EXPECT_EQ(encoder.encode(input.data(), count, out.data(), kChunk, &produced, &code), ChunkEncoder::Result::Fit);
+      out.resize(produced);
+      return out;
+    };
+    auto fresh = ChunkEncoder::create(GetParam(), level);
+    Bytes alone = encode(*fresh, text, kChunk);
+    Bytes shortAlone = encode(*ChunkEncoder::create(GetParam(), level), text, 5000);
+    auto used = ChunkEncoder::create(GetParam(), level);
+    encode(*used, other, kChunk);
+    encode(*used, noise, kChunk / 2);
+    EXPECT_EQ(encode(*used, text, kChunk), alone);
+    // The same short chunk with different bytes after it in the buffer.
+    Bytes padded = text;
+    std::copy(noise.begin() + 5000, noise.end(), padded.begin() + 5000);
+    EXPECT_EQ(encode(*used, padded, 5000), shortAlone);
+  }
+}
+
 // A chunk read in pieces gives the same bytes as one read, and a damaged one the code zlib
 // gives, whatever the engine does inside.
 TEST_P(ChunkEngines, PiecewiseDecodingAndDamageMatchZlib) {
