@@ -1,11 +1,14 @@
 #!/usr/bin/env bash
-# plzc install against what a user would pick instead, on one corpus in one run: the seeded
-# 256 MiB mixed tree of make_corpus.py (seed 1) on /dev/shm is installed with plzc install,
-# compressed in place with plzc compress -j 2 (a copy), packed with mksquashfs (gzip level 5,
-# 64 KiB blocks, 2 processors), and its 64 KiB chunks deflated at level 5 by raw zlib on one
-# and two threads (the ceiling for zlib-format chunks). Each is run once; prints one table of
-# throughput (MB = 10^6 bytes of logical data per second) and stored/logical ratio, with the
-# ratios of plzc install to mksquashfs and to the 2-thread ceiling.
+# plzc install and plzc compress against what a user would pick instead, on one corpus in one
+# run: the seeded 256 MiB mixed tree of make_corpus.py (seed 1) on /dev/shm is installed with
+# plzc install and compressed in place with plzc compress -j 2 (a copy), once with each engine
+# (libdeflate, the default; isal through --fast; zlib, the reference), packed with mksquashfs
+# (gzip level 5, 64 KiB blocks, 2 processors), and its 64 KiB chunks deflated at level 5 and
+# inflated back by raw zlib on one and two threads (the ceiling for zlib-format chunks). Every
+# tree compressed in place is then read back with plzc cat by every engine and compared with
+# the corpus, and timed once with the default engine against raw zlib inflate on one thread.
+# Each command is run once; prints one table of throughput (MB = 10^6 bytes of logical data per
+# second) and stored/logical ratio, with the ratios to mksquashfs and to the 2-thread ceiling.
 #
 # Usage: Benchmarks/installBench.sh [--bench-dir DIR] [--plzc PLZC] [--work DIR]
 #   --bench-dir  the peers' tools (make_corpus.py, zlib_ceiling.c); default ../shared/bench
@@ -59,14 +62,43 @@ seconds() {
 stored() { "$plzc" info -r "$1" | awk '$1 == "stored" {print $2}'; }
 
 sync
-s_install=$(seconds "$plzc" install --no-progress -j 2 "$corpus" "$work/installed")
-o_install=$(stored "$work/installed")
-rm -rf "$work/installed"
+# The corpus's files in one order, and the digest of their bytes end to end, for the
+# read-back checks.
+(cd "$corpus" && find . -type f -print0 | sort -z) >"$work/files"
+expected=$(cd "$corpus" && xargs -0 cat <"$work/files" | sha256sum)
+# readBack TREE: every engine reads every file of TREE, in the same order; each must give the
+# corpus's bytes.
+readBack() {
+  local reader got
+  for reader in libdeflate isal zlib; do
+    got=$(cd "$1" && xargs -0 "$plzc" cat --engine "$reader" <"$work/files" | sha256sum)
+    if [ "$got" != "$expected" ]; then
+      echo "installBench: $1 read back by $reader differs from the corpus" >&2
+      exit 1
+    fi
+  done
+}
 
-cp -a "$corpus" "$work/copy"
-s_compress=$(seconds "$plzc" compress --no-progress -j 2 "$work/copy")
-o_compress=$(stored "$work/copy")
-rm -rf "$work/copy"
+engines=(libdeflate isal zlib)
+declare -A s_install o_install s_compress o_compress
+for engine in "${engines[@]}"; do
+  choice=(--engine "$engine")
+  if [ "$engine" = isal ]; then choice=(--fast); fi
+  s_install[$engine]=$(seconds "$plzc" install --no-progress "${choice[@]}" -j 2 "$corpus" "$work/installed")
+  o_install[$engine]=$(stored "$work/installed")
+  rm -rf "$work/installed"
+
+  cp -a "$corpus" "$work/copy"
+  sync
+  s_compress[$engine]=$(seconds "$plzc" compress --no-progress "${choice[@]}" -j 2 "$work/copy")
+  o_compress[$engine]=$(stored "$work/copy")
+  readBack "$work/copy"
+  if [ "$engine" = libdeflate ]; then
+    # catFile of every file of the tree, in as few processes as the command line allows.
+    s_cat=$(seconds sh -c "cd '$work/copy' && xargs -0 '$plzc' cat <'$work/files' >/dev/null")
+  fi
+  rm -rf "$work/copy"
+done
 
 s_squash=$(seconds mksquashfs "$corpus" "$work/out.sqsh" -comp gzip -Xcompression-level 5 -b 65536 -processors 2 \
   -noappend -no-progress)
@@ -77,24 +109,41 @@ rm -f "$work/out.sqsh"
 "$work/zlib_ceiling" "$corpus" 1 >"$work/ceiling.txt"
 read -r s_ceiling1 o_ceiling < <(awk -F'\t' '/deflate 1T/ {print $2, $3}' "$work/ceiling.txt")
 read -r s_ceiling2 _ < <(awk -F'\t' '/deflate 2T/ {print $2, $3}' "$work/ceiling.txt")
+read -r s_inflate1 _ < <(awk -F'\t' '/inflate 1T/ {print $2, $3}' "$work/ceiling.txt")
 
 echo "# $(grep -m1 'model name' /proc/cpuinfo | cut -d: -f2 | xargs), $(nproc) cores, $(uname -r), load average $(cut -d' ' -f1-3 /proc/loadavg)"
-echo "# zlib $(dpkg-query -W -f '${Version}' zlib1g 2>/dev/null), $(mksquashfs -version 2>&1 | sed -n 1p), $("$plzc" --version)"
+echo "# zlib $(dpkg-query -W -f '${Version}' zlib1g 2>/dev/null), libdeflate $(dpkg-query -W -f '${Version}' libdeflate0 2>/dev/null), isa-l $(dpkg-query -W -f '${Version}' libisal2 2>/dev/null), $(mksquashfs -version 2>&1 | sed -n 1p), $("$plzc" --version)"
 echo "# corpus: make_corpus.py --size-mb 256 --seed 1: $files files, $bytes bytes; one run each; MB = 10^6 bytes"
-awk -v b="$bytes" \
-    -v si="$s_install" -v oi="$o_install" -v sc="$s_compress" -v oc="$o_compress" \
-    -v sq="$s_squash" -v oq="$o_squash" -v z1="$s_ceiling1" -v z2="$s_ceiling2" -v oz="$o_ceiling" '
+echo "# every tree compressed in place read back by libdeflate, isal and zlib: identical to the corpus"
+{
+  for engine in "${engines[@]}"; do
+    echo "install $engine ${s_install[$engine]} ${o_install[$engine]}"
+    echo "compress $engine ${s_compress[$engine]} ${o_compress[$engine]}"
+  done
+} | awk -v b="$bytes" -v sq="$s_squash" -v oq="$o_squash" -v z1="$s_ceiling1" -v z2="$s_ceiling2" -v oz="$o_ceiling" \
+        -v cat="$s_cat" -v inf1="$s_inflate1" '
   function row(name, s, o) {
-    printf "%-36s %8.2f %8.1f %7.3f %9.2f %9.2f %9.3f\n", name, s, b / s / 1e6, o / b, sq / s, z2 / s, (o / b) / (oq / b)
+    printf "%-40s %8.2f %8.1f %7.3f %9.2f %9.2f %9.3f\n", name, s, b / s / 1e6, o / b, sq / s, z2 / s, (o / b) / (oq / b)
   }
-  BEGIN {
-    printf "%-36s %8s %8s %7s %9s %9s %9s\n", "", "seconds", "MB/s", "ratio", "speed/sq", "speed/z2", "ratio/sq"
-    row("plzc install -j 2", si, oi)
-    row("plzc compress -j 2 (in place)", sc, oc)
+  { kind[NR] = $1; engine[NR] = $2; secs[NR] = $3; out[NR] = $4 }
+  END {
+    printf "%-40s %8s %8s %7s %9s %9s %9s\n", "", "seconds", "MB/s", "ratio", "speed/sq", "speed/z2", "ratio/sq"
+    for (i = 1; i <= NR; i++) {
+      name = "plzc " kind[i] " -j 2 " (engine[i] == "isal" ? "--fast (isal)" : "--engine " engine[i])
+      row(name, secs[i], out[i])
+      if (engine[i] == "libdeflate") { di[kind[i]] = secs[i]; do_[kind[i]] = out[i] }
+      if (engine[i] == "isal") { fi[kind[i]] = secs[i]; fo[kind[i]] = out[i] }
+    }
     row("mksquashfs gzip-5 64K -processors 2", sq, oq)
     row("raw zlib-5 64 KiB chunks, 1 thread", z1, oz)
     row("raw zlib-5 64 KiB chunks, 2 threads", z2, oz)
+    printf "%-40s %8.2f %8.1f\n", "plzc cat of the compressed tree", cat, b / cat / 1e6
+    printf "%-40s %8.2f %8.1f\n", "raw zlib inflate, 1 thread", inf1, b / inf1 / 1e6
     print ""
-    printf "plzc install: %.2f x the 2-thread zlib ceiling (target at least 0.9), %.2f x mksquashfs (target at least 1),\n", z2 / si, sq / si
-    printf "ratio %.3f against mksquashfs %.3f (target: no worse)\n", oi / b, oq / b
+    for (k in di) {
+      printf "default engine, %s: %.2f x mksquashfs (target at least 2), ratio %.3f against %.3f (target: no worse)\n",
+             k, sq / di[k], do_[k] / b, oq / b
+      printf "--fast, %s: %.2f x mksquashfs (target at least 4), ratio %.3f (target at most 0.49)\n", k, sq / fi[k], fo[k] / b
+    }
+    printf "plzc cat: %.2f x raw zlib inflate on one thread (target at least 2)\n", inf1 / cat
   }'
