@@ -16,6 +16,7 @@
 
 #include "Common/ChunkEngine.h"
 #include "Common/Diagnostics.h"
+#include "Common/KeptBuffer.h"
 #include "Platform/Syscalls.h"
 
 static constexpr char kSourcePath[] = "Common/commonUtils";
@@ -212,8 +213,8 @@ int64_t chunkingDecompressor(int64_t offset, uint64_t size, uint32_t vectorCount
       return -1;
     }
   }
-  Buffer chunkBuffer = allocate(static_cast<size_t>(chunkSize) + prefixBytes + 1 + suffixBytes);
-  if (!chunkBuffer) {
+  KeptBuffer chunkBuffer(KeptBuffer::kChunkInput, static_cast<size_t>(chunkSize) + prefixBytes + 1 + suffixBytes);
+  if (!chunkBuffer.get()) {
     PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
     return -1;
   }

@@ -835,13 +835,20 @@ ssize_t flistxattr(int fd, char *names, size_t size, int options) {
   return listValues(Target::ofFd(fd), names, size, options);
 }
 
+// The thread keeps the state, and the segment buffers in it, from one cache to the next: a
+// reader going through many files would otherwise allocate and free them for every file.
+thread_local ReadCacheState tKeptReadCache;
+
 XattrReadCache::XattrReadCache() : active_(tReadCache == nullptr) {
-  if (active_) tReadCache = new ReadCacheState;
+  if (active_) tReadCache = &tKeptReadCache;
 }
 
 XattrReadCache::~XattrReadCache() {
   if (!active_) return;
-  delete tReadCache;
+  // What was read stays valid only while this cache lives: another process may rewrite the
+  // file before the next one.
+  for (ReadCacheState::Slot &slot : tReadCache->slots) slot.key.clear();
+  tReadCache->segmentedValue.clear();
   tReadCache = nullptr;
 }
 

@@ -9,6 +9,7 @@
 #include <cstring>
 
 #include "Common/Diagnostics.h"
+#include "Common/KeptBuffer.h"
 #include "Common/ThrottlingAllocator.h"
 #include "Libraries/CompressData/CompressData.h"
 #include "Libraries/CompressData/CompressorRegistry.h"
@@ -74,6 +75,7 @@ int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx) {
     PLZC_ERR("%s:%d: waitThenAllocate(%llu): %s\n", static_cast<unsigned long long>(size), strerror(errno));
     return -1;
   }
+  KeptBuffer outputBuffer(KeptBuffer::kDecompressOutput, kPieceSize);
   uint8_t *output = nullptr;
   int result = -1;
   if (fh->getxattr(fh, kDecmpfsXattrName, block->attribute, static_cast<uint64_t>(size), 0, options) != size) {
@@ -86,7 +88,7 @@ int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx) {
       memcpy(&header, block->attribute, sizeof header);
       row = compressorForReading(header.compressionType);
     }
-    output = static_cast<uint8_t *>(sys::malloc(kPieceSize));
+    output = outputBuffer.get();
     if (!row) {
       // A header too short to hold a type is refused like an unknown type.
       PLZC_ERR("%s:%d: Error: invalid compressor type %d\n", static_cast<int>(header.compressionType));
@@ -108,7 +110,6 @@ int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx) {
       }
     }
   }
-  free(output);
   freeAndSignal(block, blockSize);
   return result;
 }
