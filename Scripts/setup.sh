@@ -9,6 +9,7 @@ packages=(
   zlib1g-dev libmd-dev libplist-dev              # chunk codec, digests, property lists
   libdeflate-dev libisal-dev                     # the faster chunk engines
   attr e2fsprogs util-linux mount                # getfattr, mkfs.ext4, loop mounts in tests
+  libfuse3-dev fuse3 rsync                       # plzc mount, and copying out of it in tests
 )
 
 missing=()
