@@ -18,11 +18,11 @@
 static constexpr char kSourcePath[] = "Libraries/CompressData/CompressData";
 
 const CompressorOps allCompressors[kRegisteredCompressors] = {
-    {nullptr, nullptr, nullptr, nullptr},
-    {nullptr, nullptr, nullptr, nullptr},
-    {nullptr, nullptr, nullptr, nullptr},
-    {initCompressorType3, freeContextType3, compressFileType3, doUncompressType3},
-    {initCompressorType4, freeContextType4, compressFileType4, doUncompressType4},
+    {nullptr, nullptr, nullptr, nullptr, 0},
+    {nullptr, nullptr, nullptr, nullptr, 0},
+    {nullptr, nullptr, nullptr, nullptr, 0},
+    {initCompressorType3, freeContextType3, compressFileType3, doUncompressType3, kType3ChunkSize},
+    {initCompressorType4, freeContextType4, compressFileType4, doUncompressType4, kType4ChunkSize},
 };
 
 const CompressorOps *compressorForReading(uint32_t compressionType) {

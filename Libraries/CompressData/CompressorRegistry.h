@@ -24,6 +24,8 @@ struct CompressorOps {
   // read, preceded by its length (a host-order uint32). Bytes produced, or -1.
   int64_t (*doUncompress)(FileHandle *handle, int64_t offset, uint64_t size, uint32_t vectorCount,
                           const struct iovec *vectors, const void *attribute);
+  // Logical bytes per chunk: the smallest unit a read decodes, 0 for an empty row.
+  uint32_t chunkSize;
 };
 
 constexpr int kRegisteredCompressors = 5;

@@ -7,12 +7,12 @@
 #include <atomic>
 #include <cerrno>
 #include <cstring>
+#include <memory>
 
 #include "Common/Diagnostics.h"
 #include "Common/KeptBuffer.h"
-#include "Common/ThrottlingAllocator.h"
 #include "Libraries/CompressData/CompressData.h"
-#include "Libraries/CompressData/CompressorRegistry.h"
+#include "Libraries/CompressData/CompressedReader.h"
 #include "Libraries/CompressData/DiskHeader.h"
 #include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
@@ -57,60 +57,50 @@ struct timeval toTimeval(const struct timespec &time) {
 int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx) {
   // The fork is read in small pieces (table entries, chunks): keep the segments they fall in.
   platform::XattrReadCache segmentCache;
-  int options = osSupportsDecmpfs() ? kShowCompressionOption : 0;
-  int64_t size = fh->getxattr(fh, kDecmpfsXattrName, nullptr, 0, 0, options);
-  if (size == -1) {
-    PLZC_ERR("%s:%d: fh_getxattr(%s,%s): %s\n", fh->name, kDecmpfsXattrName, strerror(errno));
-    return -1;
-  }
-  if (size < 0 || size > kMaxReadableHeaderSize) {
-    errno = EINVAL;
-    PLZC_ERR("%s:%d: Error: %s of %s claims %lld bytes: damaged\n", kDecmpfsXattrName, fh->name,
-             static_cast<long long>(size));
-    return -1;
-  }
-  uint64_t blockSize = static_cast<uint64_t>(size) + 4;
-  auto *block = static_cast<AttrBuffer *>(waitThenAllocate(blockSize, 0));
-  if (!block) {
-    PLZC_ERR("%s:%d: waitThenAllocate(%llu): %s\n", static_cast<unsigned long long>(size), strerror(errno));
-    return -1;
+  std::unique_ptr<plzc::CompressedReader> reader;
+  plzc::CompressedReader::Found found;
+  switch (plzc::CompressedReader::open(fh, &reader, &found)) {
+    case plzc::CompressedReader::Status::Ok:
+      break;
+    case plzc::CompressedReader::Status::Unreadable:
+      PLZC_ERR("%s:%d: fh_getxattr(%s,%s): %s\n", fh->name, kDecmpfsXattrName, strerror(errno));
+      return -1;
+    case plzc::CompressedReader::Status::Oversized:
+      PLZC_ERR("%s:%d: Error: %s of %s claims %lld bytes: damaged\n", kDecmpfsXattrName, fh->name,
+               static_cast<long long>(found.attributeSize));
+      return -1;
+    case plzc::CompressedReader::Status::NoMemory:
+      PLZC_ERR("%s:%d: waitThenAllocate(%llu): %s\n", static_cast<unsigned long long>(found.attributeSize),
+               strerror(errno));
+      return -1;
+    case plzc::CompressedReader::Status::WrongMagic:
+      PLZC_ERR("%s:%d: Error: incorrect magic in the header of '%s'\n", fh->name);
+      return -1;
+    case plzc::CompressedReader::Status::ShortHeader:
+    case plzc::CompressedReader::Status::UnsupportedType:
+      // A header too short to hold a type is refused like an unknown type.
+      PLZC_ERR("%s:%d: Error: invalid compressor type %d\n", static_cast<int>(found.header.compressionType));
+      return -1;
   }
   KeptBuffer outputBuffer(KeptBuffer::kDecompressOutput, kPieceSize);
-  uint8_t *output = nullptr;
-  int result = -1;
-  if (fh->getxattr(fh, kDecmpfsXattrName, block->attribute, static_cast<uint64_t>(size), 0, options) != size) {
-    PLZC_ERR("%s:%d: fh_getxattr(%s,%s): %s\n", fh->name, kDecmpfsXattrName, strerror(errno));
-  } else {
-    block->attrSize = static_cast<uint32_t>(size);
-    DiskHeader header{};
-    const CompressorOps *row = nullptr;
-    if (size >= static_cast<int64_t>(sizeof header)) {
-      memcpy(&header, block->attribute, sizeof header);
-      row = compressorForReading(header.compressionType);
-    }
-    output = outputBuffer.get();
-    if (!row) {
-      // A header too short to hold a type is refused like an unknown type.
-      PLZC_ERR("%s:%d: Error: invalid compressor type %d\n", static_cast<int>(header.compressionType));
-    } else if (!output) {
-      PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
-    } else {
-      int64_t remaining = static_cast<int64_t>(header.uncompressedSize), offset = 0;
-      result = 0;
-      while (remaining > 0) {
-        struct iovec vector = {output, static_cast<size_t>(remaining < kPieceSize ? remaining : kPieceSize)};
-        int64_t produced = row->doUncompress(fh, offset, vector.iov_len, 1, &vector, block);
-        // Nothing produced while bytes remain would ask for the same piece for ever.
-        if (produced <= 0 || writer(offset, output, produced, writerCtx) == -1) {
-          result = -1;
-          break;
-        }
-        remaining -= produced;
-        offset += produced;
-      }
-    }
+  uint8_t *output = outputBuffer.get();
+  if (!output) {
+    PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
+    return -1;
   }
-  freeAndSignal(block, blockSize);
+  int result = 0;
+  int64_t remaining = static_cast<int64_t>(reader->logicalSize()), offset = 0;
+  while (remaining > 0) {
+    int64_t produced = reader->read(offset, static_cast<uint64_t>(remaining < kPieceSize ? remaining : kPieceSize),
+                                    output);
+    // Nothing produced while bytes remain would ask for the same piece for ever.
+    if (produced <= 0 || writer(offset, output, produced, writerCtx) == -1) {
+      result = -1;
+      break;
+    }
+    remaining -= produced;
+    offset += produced;
+  }
   return result;
 }
 

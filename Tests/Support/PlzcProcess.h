@@ -101,6 +101,7 @@ class Process {
     return true;
   }
   void signal(int number) { kill(pid_, number); }
+  pid_t pid() const { return pid_; }
 
   Finished wait() {
     while (pump(1000)) {

@@ -29,6 +29,7 @@ int tocCommand(int argc, char **argv);
 int demoCommand(int argc, char **argv);
 int installCommand(int argc, char **argv);
 int repairCommand(int argc, char **argv);
+int mountCommand(int argc, char **argv);
 
 // Parses the subcommand's options with getopt_long, silently (opterr 0). Returns the option's
 // value, -1 at the end of the options, or '?' after printing what was wrong with the

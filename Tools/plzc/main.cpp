@@ -21,6 +21,7 @@ const Subcommand kSubcommands[] = {
     {"compress", plzc::compressCommand}, {"decompress", plzc::decompressCommand}, {"cat", plzc::catCommand},
     {"info", plzc::infoCommand},         {"volume", plzc::volumeCommand},         {"toc", plzc::tocCommand},
     {"demo", plzc::demoCommand},         {"install", plzc::installCommand},       {"repair", plzc::repairCommand},
+    {"mount", plzc::mountCommand},
 };
 
 void printHelp() {
@@ -44,6 +45,9 @@ void printHelp() {
       "                        summary of each tree\n"
       "  volume PATH...        can the volume hold compressed files, and why not\n"
       "  toc list FILE         list the records of a table-of-contents file\n"
+      "  mount [-f] [-o OPTION[,...]] DIR MOUNTPOINT\n"
+      "                        serve DIR through FUSE at MOUNTPOINT, its compressed files read\n"
+      "                        as plain ones; unmount with 'fusermount3 -u MOUNTPOINT'\n"
       "  demo [DIR]            compress a generated corpus under DIR (default /dev/shm), print the\n"
       "                        savings and check that every file reads back byte for byte\n"
       "\n"
