@@ -31,6 +31,8 @@ KeptBuffer::KeptBuffer(Slot slot, size_t size) : slot_(slot) {
     free(kept.bytes);
     kept.bytes = static_cast<uint8_t *>(sys::malloc(size ? size : 1));
     kept.size = kept.bytes ? size : 0;
+  } else if (!sys::callSucceeds(sys::Call::Malloc)) {
+    return;  // an injected failure, as if the buffer had been allocated now
   }
   bytes_ = kept.bytes;
   kept_ = kept.taken = bytes_ != nullptr;

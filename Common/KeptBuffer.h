@@ -4,8 +4,9 @@
 // same buffers for every file or piece; buffers of this size live at the top of the heap, so
 // each free shrinks the heap and the next call grows it again, and every shrink flushes the
 // TLB. A KeptBuffer hands out the calling thread's buffer for its slot, allocated (with
-// sys::malloc, so that tests can make it fail) on first use or when a larger one is asked for,
-// and kept until the thread ends. A second KeptBuffer of the same slot on the same thread while
+// sys::malloc) on first use or when a larger one is asked for, and kept until the thread ends.
+// Every use counts as one allocation for fault injection, whether or not one was made, so
+// tests can fail it and call counts do not depend on which thread ran before. A second KeptBuffer of the same slot on the same thread while
 // the first lives (a nested read) gets a buffer of its own, freed when it ends.
 #pragma once
 

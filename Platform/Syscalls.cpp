@@ -39,6 +39,8 @@ bool injected(Call call) {
 
 }  // namespace
 
+bool callSucceeds(Call call) { return !injected(call); }
+
 void armFault(Call call, uint64_t nth, int error, bool sticky) {
   FaultSlot &slot = gSlots[static_cast<int>(call)];
   slot.error.store(error, std::memory_order_relaxed);

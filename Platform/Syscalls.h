@@ -100,5 +100,9 @@ void armFault(Call call, uint64_t nth, int error, bool sticky = false);
 void clearFaults();
 // Number of calls of this kind made since the process started.
 uint64_t callCount(Call call);
+// For a call that the caller serves itself this time (a buffer kept from an earlier
+// allocation): counts it like a real call, and returns false with errno set when a fault armed
+// for it fires. Counts and faults then do not depend on what a thread happens to keep.
+bool callSucceeds(Call call);
 
 }  // namespace sys

@@ -49,8 +49,9 @@ TEST(KeptBuffer, ReusedByTheThreadAndNeverSharedWhileTaken) {
   EXPECT_NE(mine.get(), nullptr);
 }
 
-// An allocation that fails gives null, and the next use tries again.
-TEST(KeptBuffer, FailedAllocationGivesNullAndIsRetried) {
+// An allocation that fails gives null, and the next use tries again. Every use counts as one
+// allocation, so an injected failure hits a thread that already keeps a buffer too.
+TEST(KeptBuffer, EveryUseCanBeFailedLikeAnAllocation) {
   std::thread([] {
     sys::armFault(sys::Call::Malloc, 1, ENOMEM);
     {
@@ -58,8 +59,15 @@ TEST(KeptBuffer, FailedAllocationGivesNullAndIsRetried) {
       EXPECT_EQ(failed.get(), nullptr);
     }
     sys::clearFaults();
-    KeptBuffer retried(KeptBuffer::kChunkInput, 4096);
-    EXPECT_NE(retried.get(), nullptr);
+    { KeptBuffer retried(KeptBuffer::kChunkInput, 4096); EXPECT_NE(retried.get(), nullptr); }
+    uint64_t before = sys::callCount(sys::Call::Malloc);
+    { KeptBuffer reused(KeptBuffer::kChunkInput, 4096); EXPECT_NE(reused.get(), nullptr); }
+    EXPECT_EQ(sys::callCount(sys::Call::Malloc), before + 1);
+    sys::armFault(sys::Call::Malloc, 1, ENOMEM);
+    KeptBuffer failedAgain(KeptBuffer::kChunkInput, 4096);
+    sys::clearFaults();
+    EXPECT_EQ(failedAgain.get(), nullptr);
+    EXPECT_EQ(errno, ENOMEM);
   }).join();
 }
 
