@@ -5,6 +5,7 @@
 #include <cstring>
 
 #include "Cli.h"
+#include "Common/StreamCompressor.h"
 #include "CompressRun.h"
 #include "FileWalk.h"
 #include "Plenzo.h"
@@ -29,6 +30,14 @@ CompressResult runCompressAsync(const CompressOptions &options, const std::vecto
   PVRelease(queueOptions);
   if (!queue) {
     report("cannot set up the compression queue%s%s\n", problem.empty() ? "" : ": ", problem.c_str());
+    result.setupFailed = true;
+    return result;
+  }
+  // Set up now, before the walk's threads take their memory: the pipeline's threads must be
+  // started while the process can still afford them.
+  if (!_SQLazyInit(queue)) {
+    report("cannot start the compression queue: %s\n", strerror(errno ? errno : ENOMEM));
+    FinishCompressionAndCleanUp(queue);
     result.setupFailed = true;
     return result;
   }

@@ -570,6 +570,14 @@ InstallResult runInstall(const std::vector<std::string> &sources, const std::str
     result.setupFailed = true;
     return result;
   }
+  // Set up now, before the copying threads take their memory: the pipeline's threads must be
+  // started while the process can still afford them.
+  if (!_SQLazyInit(queue)) {
+    report("cannot start the stream pipeline: %s\n", strerror(errno ? errno : ENOMEM));
+    FinishStreamCompressorQueue(queue);
+    result.setupFailed = true;
+    return result;
+  }
 
   StderrTap tap;
   ProgressMeter progress(console, "plzc install");
