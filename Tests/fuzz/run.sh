@@ -100,8 +100,8 @@ for target in "${targets[@]}"; do
   options=(-print_final_stats=1 -close_fd_mask=3 -timeout=30 -rss_limit_mb=2560 -artifact_prefix="$artifacts/")
   if [ $cpu_time -eq 1 ]; then
     # Stopped with SIGINT once its CPU time (user + system, in clock ticks) reaches the budget;
-    # libFuzzer then prints its final statistics and exits 0.
-    "$binary" -interrupted_exitcode=0 "${options[@]}" "${corpora[@]}" >>"$log" 2>&1 &
+    # libFuzzer then prints its final statistics and exits, which is no failure.
+    "$binary" "${options[@]}" "${corpora[@]}" >>"$log" 2>&1 &
     pid=$!
     ticks=$(getconf CLK_TCK)
     while kill -0 $pid 2>/dev/null; do
@@ -113,6 +113,7 @@ for target in "${targets[@]}"; do
       sleep 1
     done
     wait $pid || status=$?
+    if [ $status -ne 0 ] && grep -q 'libFuzzer: run interrupted; exiting' "$log"; then status=0; fi
     cpu=$(awk -v t="$used" -v k="$ticks" 'BEGIN {printf "%.0f", t / k}')
   else
     "$binary" -max_total_time="$seconds" "${options[@]}" "${corpora[@]}" >>"$log" 2>&1 || status=$?
