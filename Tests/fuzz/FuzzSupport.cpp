@@ -155,7 +155,6 @@ void handleSeedMode(int argc, char **argv, void (*writeSeeds)(SeedSink &seeds)) 
 
 std::string xmlPropertyList(const std::string &body) {
   return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
-         "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" \"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
          "<plist version=\"1.0\">\n" +
          body + "\n</plist>\n";
 }
