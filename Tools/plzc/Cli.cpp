@@ -63,6 +63,14 @@ bool parseNumber(const char *text, long min, long max, long *out) {
   return true;
 }
 
+int chooseJobs(const char *command, const char *text, int *jobs) {
+  long number = 0;
+  if (!parseNumber(text, 1, 1024, &number))
+    return usageError(command, std::string("invalid number of jobs '") + text + "': give 1 to 1024");
+  *jobs = static_cast<int>(number);
+  return kExitSuccess;
+}
+
 const char kEngineHelp[] =
     "      --engine=NAME  deflate engine: libdeflate (the default), zlib (the reference) or\n"
     "                     isal (fastest, larger output); every engine reads what any other wrote\n";

@@ -42,6 +42,10 @@ int usageError(const char *command, const std::string &message);
 // Parses a whole decimal number in [min, max]; false when text is anything else.
 bool parseNumber(const char *text, long min, long max, long *out);
 
+// -j N: the number of files worked on at once, 1 to 1024. Returns kExitSuccess with *jobs
+// set, or kExitUsage after saying what was wrong.
+int chooseJobs(const char *command, const char *text, int *jobs);
+
 // --engine NAME: makes NAME ("zlib", "libdeflate", "isal") the chunk engine of this run.
 // Returns kExitSuccess, or kExitUsage after saying what was wrong (not an engine, or not built
 // into this plzc).

@@ -79,9 +79,7 @@ int compressCommand(int argc, char **argv) {
         options.level = static_cast<int>(number);
         break;
       case 'j':
-        if (!parseNumber(optarg, 1, 1024, &number))
-          return usageError(command, std::string("invalid number of jobs '") + optarg + "': give 1 to 1024");
-        options.jobs = static_cast<int>(number);
+        if (chooseJobs(command, optarg, &options.jobs) != kExitSuccess) return kExitUsage;
         break;
       case kVerify: options.verify = true; break;
       case kToc:

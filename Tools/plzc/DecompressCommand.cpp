@@ -144,7 +144,6 @@ int decompressCommand(int argc, char **argv) {
   const char *command = "decompress";
   bool verify = false, userSpace = false, verbose = false, progressWanted = true;
   int jobs = availableProcessors();
-  long number;
   for (int c; (c = nextOption(command, argc, argv, "j:vh", kDecompressOptions)) != -1;) {
     switch (c) {
       case kVerify: verify = true; break;
@@ -154,9 +153,7 @@ int decompressCommand(int argc, char **argv) {
         break;
       case kNoProgress: progressWanted = false; break;
       case 'j':
-        if (!parseNumber(optarg, 1, 1024, &number))
-          return usageError(command, std::string("invalid number of jobs '") + optarg + "': give 1 to 1024");
-        jobs = static_cast<int>(number);
+        if (chooseJobs(command, optarg, &jobs) != kExitSuccess) return kExitUsage;
         break;
       case 'v': verbose = true; break;
       case 'h': printDecompressHelp(); return kExitSuccess;

@@ -92,7 +92,6 @@ int demoCommand(int argc, char **argv) {
   bool keep = false, generateOnly = false, verbose = false, progress = true;
   CompressOptions options;
   options.jobs = availableProcessors();
-  long number;
   for (int c; (c = nextOption(command, argc, argv, "j:vh", kOptions)) != -1;) {
     switch (c) {
       case kSizeMb:
@@ -104,9 +103,7 @@ int demoCommand(int argc, char **argv) {
           return usageError(command, std::string("invalid seed '") + optarg + "'");
         break;
       case 'j':
-        if (!parseNumber(optarg, 1, 1024, &number))
-          return usageError(command, std::string("invalid number of jobs '") + optarg + "': give 1 to 1024");
-        options.jobs = static_cast<int>(number);
+        if (chooseJobs(command, optarg, &options.jobs) != kExitSuccess) return kExitUsage;
         break;
       case kKeep: keep = true; break;
       case kGenerateOnly: generateOnly = keep = true; break;

@@ -131,9 +131,7 @@ int installCommand(int argc, char **argv) {
       case kThrottled: choices.throttled = true; break;
       case kLargeForks: choices.largeForks = true; break;
       case 'j':
-        if (!parseNumber(optarg, 1, 1024, &number))
-          return usageError(command, std::string("invalid number of jobs '") + optarg + "': give 1 to 1024");
-        jobs = static_cast<int>(number);
+        if (chooseJobs(command, optarg, &jobs) != kExitSuccess) return kExitUsage;
         break;
       case kEngine:
         if (int status = chooseEngine(command, optarg); status != kExitSuccess) return status;

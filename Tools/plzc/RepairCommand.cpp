@@ -90,14 +90,11 @@ int repairCommand(int argc, char **argv) {
   const char *command = "repair";
   bool dryRun = false, verbose = false, progressWanted = true;
   int jobs = availableProcessors();
-  long number;
   for (int c; (c = nextOption(command, argc, argv, "nj:vh", kOptions)) != -1;) {
     switch (c) {
       case 'n': dryRun = true; break;
       case 'j':
-        if (!parseNumber(optarg, 1, 1024, &number))
-          return usageError(command, std::string("invalid number of jobs '") + optarg + "': give 1 to 1024");
-        jobs = static_cast<int>(number);
+        if (chooseJobs(command, optarg, &jobs) != kExitSuccess) return kExitUsage;
         break;
       case 'v': verbose = true; break;
       case kNoProgress: progressWanted = false; break;
