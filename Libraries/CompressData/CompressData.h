@@ -18,3 +18,7 @@ typedef int (*DecompressWriter)(int64_t offset, const void *bytes, int64_t count
 // Hands the logical data of the compressed file behind fh to writer. 0 when every byte went
 // out; -1 on failure (reported) or when the writer returned -1.
 int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx);
+
+// catFile, telling its caller what happened: 0 when the whole file was written to standard
+// output, -1 after the failure was reported on standard error.
+int catFileStatus(const char *path, int forceUserSpace);

@@ -16,7 +16,12 @@ CompressedReader::Status CompressedReader::open(FileHandle *fh, std::unique_ptr<
   if (!found) found = &ignored;
   *found = {};
   int options = osSupportsDecmpfs() ? kShowCompressionOption : 0;
-  int64_t size = fh->getxattr(fh, kDecmpfsXattrName, nullptr, 0, 0, options);
+  // Most headers are small (type 4's is 16 bytes, small files' whole data a few KiB): one read
+  // into a first buffer usually gets the whole attribute, and its length with it.
+  uint8_t first[4096];
+  int64_t size = fh->getxattr(fh, kDecmpfsXattrName, first, sizeof first, 0, options);
+  bool haveBytes = size >= 0;
+  if (size == -1 && errno == ERANGE) size = fh->getxattr(fh, kDecmpfsXattrName, nullptr, 0, 0, options);
   if (size == -1) return Status::Unreadable;
   found->attributeSize = size;
   if (size < 0 || size > kMaxReadableHeaderSize) {
@@ -30,7 +35,9 @@ CompressedReader::Status CompressedReader::open(FileHandle *fh, std::unique_ptr<
   made->fh_ = fh;
   made->attribute_ = block;
   made->attributeBlockSize_ = blockSize;
-  if (fh->getxattr(fh, kDecmpfsXattrName, block->attribute, static_cast<uint64_t>(size), 0, options) != size)
+  if (haveBytes)
+    memcpy(block->attribute, first, static_cast<size_t>(size));
+  else if (fh->getxattr(fh, kDecmpfsXattrName, block->attribute, static_cast<uint64_t>(size), 0, options) != size)
     return Status::Unreadable;
   block->attrSize = static_cast<uint32_t>(size);
   if (size < static_cast<int64_t>(sizeof(DiskHeader))) return Status::ShortHeader;

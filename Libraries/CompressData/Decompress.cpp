@@ -255,38 +255,55 @@ int decompressFile(const char *path, bool verify, int forceUserSpace) {
   return 0;
 }
 
-void catFile(const char *path, int forceUserSpace) {
+int catFileStatus(const char *path, int forceUserSpace) {
   platform::Stat st;
   if (platform::stat(path, &st) != 0) {
     PLZC_ERR("%s:%d: stat(%s): %s\n", path, strerror(errno));
-    return;
+    return -1;
   }
   if ((st.st_flags & kCompressedFlag) && (!osSupportsDecmpfs() || forceUserSpace)) {
     FileHandle *fh = openFile(path, path, O_RDONLY);
     if (!fh) {
       PLZC_ERR("%s:%d: Error: Failed to open compressed file at path '%s': %s (%d)\n", path, strerror(errno), errno);
-      return;
+      return -1;
     }
-    if (decompressData(fh, catWriter, nullptr) == -1)
+    int result = decompressData(fh, catWriter, nullptr);
+    if (result == -1)
       PLZC_ERR("%s:%d: Error: Failed to decompress data for file at path '%s': %s (%d)\n", path, strerror(errno),
                errno);
     fh->close(fh);
-    return;
+    return result;
   }
   int fd = sys::open(path, O_RDONLY, 0);
   if (fd < 0) {
     PLZC_ERR("%s:%d: open(%s): %s\n", path, strerror(errno));
-    return;
+    return -1;
+  }
+  KeptBuffer blockBuffer(KeptBuffer::kDecompressOutput, kPieceSize);
+  uint8_t *block = blockBuffer.get();
+  if (!block) {
+    PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
+    sys::close(fd);
+    return -1;
   }
   int64_t remaining = st.st.st_size;
-  char block[4096];
   ssize_t got;
-  while ((got = sys::read(fd, block, sizeof block)) > 0) {
+  while ((got = sys::read(fd, block, kPieceSize)) > 0) {
     ssize_t ignored = sys::write(1, block, static_cast<size_t>(got));
     (void)ignored;
     remaining -= got;
   }
-  if (got == -1) PLZC_ERR("%s:%d: read: %s\n", strerror(errno));
+  int result = 0;
+  if (got == -1) {
+    PLZC_ERR("%s:%d: read: %s\n", strerror(errno));
+    result = -1;
+  }
   sys::close(fd);
-  if (remaining != 0) PLZC_ERR("%s:%d: Error: didn't read all of '%s'\n", path);
+  if (remaining != 0) {
+    PLZC_ERR("%s:%d: Error: didn't read all of '%s'\n", path);
+    result = -1;
+  }
+  return result;
 }
+
+void catFile(const char *path, int forceUserSpace) { catFileStatus(path, forceUserSpace); }

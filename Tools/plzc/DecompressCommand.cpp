@@ -13,12 +13,12 @@
 #include "Cli.h"
 #include "Console.h"
 #include "FileWalk.h"
+#include "Libraries/CompressData/CompressData.h"
 #include "Libraries/CompressData/DiskHeader.h"
 #include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
 #include "Plenzo.h"
 #include "Progress.h"
-#include "StderrCapture.h"
 #include "StoredForm.h"
 
 namespace plzc {
@@ -231,10 +231,7 @@ int catCommand(int argc, char **argv) {
       continue;
     }
     fflush(stdout);
-    // catFile reports a failure on standard error and nowhere else.
-    std::string problems = captureStderr([&] { catFile(path.c_str(), 0); });
-    reportText(problems);
-    if (!problems.empty()) {
+    if (catFileStatus(path.c_str(), 0) != 0) {
       report("%s: could not be read whole\n", path.c_str());
       status = kExitFailure;
     }

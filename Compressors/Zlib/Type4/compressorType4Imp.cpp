@@ -76,7 +76,16 @@ struct Type4State {
   uint32_t inlineLength;  // length of the header attribute when the type-3 form was written
   uint32_t supplyOffset;  // the engine's prefix for this call
   bool consumedAll;       // the engine read the whole file and emitted every chunk
+  // Reading: a window of table entries read ahead in one call, so that a run of chunks costs
+  // one read each instead of two. Null while writing, when the table is still being filled.
+  uint8_t *tableWindow;
+  uint32_t windowFirst;   // chunk index of the window's first entry
+  uint32_t windowCount;   // entries held
+  uint32_t wantedLast;    // last chunk the current request needs
 };
+
+// Entries read ahead at most: 4 KiB of table, 32 MiB of logical data.
+constexpr uint32_t kTableWindowEntries = 512;
 
 int forkReadOptions() { return osSupportsDecmpfs() ? kShowCompressionOption : 0; }
 
@@ -134,16 +143,34 @@ uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, ui
   }
   // A corrupt count or table can point past what 32-bit fork positions reach.
   uint64_t entryPosition = kDataStart + 4 + kTableEntrySize * chunkIndex;
+  if (state->tableWindow &&
+      (chunkIndex < state->windowFirst || chunkIndex >= uint64_t{state->windowFirst} + state->windowCount)) {
+    // Read the entries of this chunk and of the next ones the request needs in one call.
+    uint64_t count = std::min<uint64_t>({kTableWindowEntries, state->chunkCount - chunkIndex,
+                                         state->wantedLast >= chunkIndex ? state->wantedLast - chunkIndex + 1 : 1});
+    int64_t got = -1;
+    if (entryPosition <= 0xFFFFFFFFULL - kTableEntrySize * count)
+      got = handle->getxattr(handle, kResourceForkXattrName, state->tableWindow, kTableEntrySize * count,
+                             static_cast<uint32_t>(entryPosition), forkReadOptions());
+    // A short or failed read leaves the window empty; the single read below then reports why.
+    state->windowFirst = static_cast<uint32_t>(chunkIndex);
+    state->windowCount = got > 0 ? static_cast<uint32_t>(got / kTableEntrySize) : 0;
+  }
   uint8_t entry[kTableEntrySize];
-  int64_t got = -1;
-  if (entryPosition <= 0xFFFFFFFFULL - kTableEntrySize)
-    got = handle->getxattr(handle, kResourceForkXattrName, entry, sizeof entry,
-                           static_cast<uint32_t>(entryPosition), forkReadOptions());
-  else
-    errno = EINVAL;
-  if (got != static_cast<int64_t>(sizeof entry)) {
-    PLZC_ERR("%s:%d: fh_getxattr %s: %s\n", handle->path, strerror(errno));
-    return kChunkError;
+  if (state->tableWindow && chunkIndex >= state->windowFirst &&
+      chunkIndex < uint64_t{state->windowFirst} + state->windowCount) {
+    memcpy(entry, state->tableWindow + kTableEntrySize * (chunkIndex - state->windowFirst), sizeof entry);
+  } else {
+    int64_t got = -1;
+    if (entryPosition <= 0xFFFFFFFFULL - kTableEntrySize)
+      got = handle->getxattr(handle, kResourceForkXattrName, entry, sizeof entry,
+                             static_cast<uint32_t>(entryPosition), forkReadOptions());
+    else
+      errno = EINVAL;
+    if (got != static_cast<int64_t>(sizeof entry)) {
+      PLZC_ERR("%s:%d: fh_getxattr %s: %s\n", handle->path, strerror(errno));
+      return kChunkError;
+    }
   }
   uint32_t chunkOffset = plzc::loadLE32(entry);
   uint32_t chunkLength = plzc::loadLE32(entry + 4);
@@ -153,7 +180,7 @@ uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, ui
     return kChunkError;
   }
   uint64_t chunkPosition = static_cast<uint64_t>(kDataStart) + chunkOffset;
-  got = -1;
+  int64_t got = -1;
   if (chunkPosition <= 0xFFFFFFFFULL)
     got = handle->getxattr(handle, kResourceForkXattrName, buffer + state->supplyOffset, chunkLength,
                            static_cast<uint32_t>(chunkPosition), forkReadOptions());
@@ -298,6 +325,10 @@ int64_t doUncompressType4(FileHandle *handle, int64_t offset, uint64_t size, uin
     return -1;
   }
   state.chunkCount = plzc::loadLE32(count);
+  uint8_t window[kTableWindowEntries * kTableEntrySize];
+  state.tableWindow = window;
+  state.wantedLast = size == 0 ? 0 : static_cast<uint32_t>(std::min<uint64_t>(
+                                         (static_cast<uint64_t>(offset) + size - 1) / kType4ChunkSize, 0xFFFFFFFFULL));
   int64_t result = chunkingDecompressor(offset, size, vectorCount, vectors, kType4ChunkSize, 0, 0, &state,
                                         supplyChunkType4);
   if (result == -1) PLZC_ERR("%s:%d: chunkingDecompressor %s: %s\n", handle->path, strerror(errno));

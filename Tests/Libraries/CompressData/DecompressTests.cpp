@@ -472,21 +472,40 @@ TEST_F(Decompress, HeaderThatCannotBeReadIsReported) {
                                     ",com\\.tavix\\.decmpfs\\): No data available\n"));
 
   std::string path = compressedFile("unreadable", 262144, 4);
+  // A header longer than the first read takes: type 3 holding 5,000 stored bytes.
+  std::string large = writeFile(dir.file("large-header"), "");
+  std::vector<uint8_t> stored(16 + 1 + 5000);
+  uint32_t magic = kDecmpfsMagic, type = 3;
+  uint64_t logical = 5000;
+  memcpy(stored.data(), &magic, 4);
+  memcpy(stored.data() + 4, &type, 4);
+  memcpy(stored.data() + 8, &logical, 8);
+  stored[16] = 0xFF;
+  for (size_t i = 17; i < stored.size(); i++) stored[i] = static_cast<uint8_t>(i * 7919 >> 3);
+  ASSERT_EQ(platform::setxattr(large.c_str(), kDecmpfsXattrName, stored.data(), stored.size(), 0, 0), 0);
+  Recorder whole;
+  ASSERT_EQ(decompressTo(large, &whole), 0);
+  EXPECT_EQ(whole.bytes, std::string(stored.begin() + 17, stored.end()));
+
+  const std::string readFailed = ",com\\.tavix\\.decmpfs\\): Input/output error";
   struct {
+    std::string path;
     sys::Call call;
     int nth;
     std::string message;
   } cases[] = {
-      // The size query, then the read itself (the plain handle reads attributes through its
-      // descriptor).
-      {sys::Call::Fgetxattr, 1, "fh_getxattr\\(" + escaped(path) + ",com\\.tavix\\.decmpfs\\): Input/output error"},
-      {sys::Call::Fgetxattr, 2, "fh_getxattr\\(" + escaped(path) + ",com\\.tavix\\.decmpfs\\): Input/output error"},
-      {sys::Call::Malloc, 1, "waitThenAllocate\\(16\\): Cannot allocate memory"},
-      {sys::Call::Malloc, 2, "malloc: Cannot allocate memory"},
+      // A short header comes whole with the first read (the plain handle reads attributes
+      // through its descriptor); a long one needs a size query and a second read.
+      {path, sys::Call::Fgetxattr, 1, "fh_getxattr\\(" + escaped(path) + readFailed},
+      {large, sys::Call::Fgetxattr, 1, "fh_getxattr\\(" + escaped(large) + readFailed},
+      {large, sys::Call::Fgetxattr, 2, "fh_getxattr\\(" + escaped(large) + readFailed},
+      {large, sys::Call::Fgetxattr, 3, "fh_getxattr\\(" + escaped(large) + readFailed},
+      {path, sys::Call::Malloc, 1, "waitThenAllocate\\(16\\): Cannot allocate memory"},
+      {path, sys::Call::Malloc, 2, "malloc: Cannot allocate memory"},
   };
   for (const auto &c : cases) {
     uint64_t chargedBefore = throttlingMemoryCharged();
-    FileHandle *fh = openFile(path.c_str(), path.c_str(), O_RDONLY);
+    FileHandle *fh = openFile(c.path.c_str(), c.path.c_str(), O_RDONLY);
     ASSERT_NE(fh, nullptr);
     Recorder caseRecorder;
     FdCapture err(2);
@@ -677,7 +696,7 @@ TEST_F(Decompress, CatFileWritesTheLogicalBytes) {
 }
 
 TEST_F(Decompress, CatFileReportsWhatItCouldNotDo) {
-  std::string plain = writeFile(dir.file("plain"), logText(10000, 4));
+  std::string plain = writeFile(dir.file("plain"), logText(300000, 4));
   std::string compressed = compressedFile("compressed", 300000, 4);
   std::string damaged = compressedFile("damaged", 300000, 4);
   setHeader(damaged, 5, 300000);
@@ -692,7 +711,7 @@ TEST_F(Decompress, CatFileReportsWhatItCouldNotDo) {
       {missing, sys::Call::Count, 0, kPrefix + "stat\\(" + escaped(missing) + "\\): No such file or directory\n", 0},
       {plain, sys::Call::Open, EACCES, kPrefix + "open\\(" + escaped(plain) + "\\): Permission denied\n", 0},
       {plain, sys::Call::Read, EIO,
-       kPrefix + "read: Input/output error\n" + kPrefix + "Error: didn't read all of '" + escaped(plain) + "'\n", 4096},
+       kPrefix + "read: Input/output error\n" + kPrefix + "Error: didn't read all of '" + escaped(plain) + "'\n", 131072},
       {compressed, sys::Call::Open, EACCES,
        "(.|\n)*" + kPrefix + "Error: Failed to open compressed file at path '" + escaped(compressed) +
            "': Permission denied \\(13\\)\n",
@@ -703,7 +722,7 @@ TEST_F(Decompress, CatFileReportsWhatItCouldNotDo) {
        0},
   };
   for (const auto &c : cases) {
-    // The plain copy reads in 4096-byte blocks: the second read fails after one block.
+    // The plain copy reads in 128 KiB blocks: the second read fails after one block.
     if (c.call != sys::Call::Count) sys::armFault(c.call, c.call == sys::Call::Read ? 2 : 1, c.error);
     std::string printed;
     std::string written = catOutput(c.path, &printed);
