@@ -389,6 +389,29 @@ TEST_F(Decompress, FailingWriterStopsTheData) {
 // Fork position of the chunk count of a type-4 file.
 constexpr uint32_t kChunkCountPosition = 260;
 
+TEST_F(Decompress, ReadingAForkCostsAboutOneAttributeReadPerChunk) {
+  // 40 chunks in 20 pieces. Each platform read of the fork is one Linux read of its index
+  // record, plus the segments it touches that are not among the two read last. Per piece the
+  // chunk count and the table entries of its chunks take one platform read each, and each
+  // chunk one more; reading the entries one by one would add one per chunk past the first.
+  const size_t chunks = 40;
+  std::string path = compressedFile("many-chunks", chunks * 65536, 4);
+  std::string expected = logText(chunks * 65536, 1);
+  ssize_t forkSize = platform::getxattr(path.c_str(), kResourceForkXattrName, nullptr, 0, 0, 0);
+  ASSERT_GT(forkSize, 65536);
+  uint64_t before = sys::callCount(sys::Call::Fgetxattr);
+  Recorder recorder;
+  ASSERT_EQ(decompressTo(path, &recorder), 0);
+  uint64_t calls = sys::callCount(sys::Call::Fgetxattr) - before;
+  EXPECT_TRUE(recorder.bytes == expected);
+  const uint64_t pieces = chunks / 2;
+  const uint64_t indexReads = 2 * pieces + chunks;
+  // Every data segment once, and the first segment (count, table) again for each piece.
+  const uint64_t segmentReads = static_cast<uint64_t>(forkSize + 65535) / 65536 + pieces;
+  // The header, and the one look for the fork as a plain attribute.
+  EXPECT_LE(calls, indexReads + segmentReads + 2) << "Linux attribute reads for " << chunks << " chunks";
+}
+
 TEST_F(Decompress, DataThatEndsEarlyEndsTheLoopWithFailure) {
   // Four chunks, but the table now claims two: the second piece finds nothing.
   std::string shortTable = compressedFile("short-table", 262144, 4);
