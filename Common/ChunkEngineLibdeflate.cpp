@@ -35,6 +35,16 @@ class LibdeflateChunkEncoder final : public ChunkEncoder {
       *code = failure_;
       return Result::Failed;
     }
+    // libdeflate learns that a stream does not fit only after compressing all of its input,
+    // where zlib stops as soon as its output is full. When the space is a small fraction of the
+    // input (the small-file form, a few KiB for up to 128 KiB), a prefix is tried first: if
+    // even that does not fit, the whole does not, and most of the work is saved.
+    if (count / kProbeFactor > space) {
+      if (libdeflate_zlib_compress(compressor_, input, uint64_t{space} * kProbeFactor, output, space) == 0) {
+        *code = Z_OK;
+        return Result::NoFit;
+      }
+    }
     size_t written = libdeflate_zlib_compress(compressor_, input, count, output, space);
     if (written == 0) {
       *code = Z_OK;
@@ -46,6 +56,8 @@ class LibdeflateChunkEncoder final : public ChunkEncoder {
   }
 
  private:
+  // The prefix tried first is this many times the space.
+  static constexpr uint32_t kProbeFactor = 4;
   libdeflate_compressor *compressor_ = nullptr;
   int failure_ = Z_OK;
 };

@@ -222,6 +222,46 @@ TEST_P(ChunkEngines, PiecewiseDecodingAndDamageMatchZlib) {
   EXPECT_EQ(code, Z_DATA_ERROR);
 }
 
+// A space far smaller than the input (the small-file form) is judged as compressing the whole
+// input would judge it, also when the start of the input compresses badly and the rest well.
+TEST_P(ChunkEngines, SmallSpaceFitsExactlyWhenTheWholeStreamFits) {
+  const uint32_t size = 2 * kChunk;
+  Bytes zerosThenRandom(size - 6000, 0);
+  Bytes tail = randomBytes(6000, 32);
+  zerosThenRandom.insert(zerosThenRandom.end(), tail.begin(), tail.end());
+  const std::pair<const char *, Bytes> inputs[] = {
+      {"text", compressibleBytes(size, 33)},       {"zeros", Bytes(size, 0)},
+      {"repeated block", repeatedBlock(size, 34)}, {"random then zeros", randomThenZeros(6000, size, 31)},
+      {"zeros then random", zerosThenRandom},      {"random", randomBytes(size, 35)},
+  };
+  auto encoder = ChunkEncoder::create(GetParam(), 5);
+  Bytes out(size + 1024);
+  uint32_t produced = 0;
+  int code = 0;
+  for (const auto &[name, input] : inputs) {
+    // The stream's length when space is no object.
+    ChunkEncoder::Result free = encoder->encode(input.data(), size, out.data(), size, &produced, &code);
+    if (free == ChunkEncoder::Result::NoFit) {
+      EXPECT_STREQ(name, "random");
+      continue;
+    }
+    ASSERT_EQ(free, ChunkEncoder::Result::Fit) << name;
+    const uint32_t whole = produced;
+    EXPECT_EQ(encoder->encode(input.data(), size, out.data(), whole + 16, &produced, &code), ChunkEncoder::Result::Fit)
+        << name << ": " << whole << " bytes in " << whole + 16;
+    EXPECT_EQ(produced, whole) << name;
+    Bytes back(size);
+    uLongf backLength = size;
+    EXPECT_EQ(uncompress(back.data(), &backLength, out.data(), produced), Z_OK) << name;
+    EXPECT_TRUE(backLength == size && back == input) << name;
+    if (whole > 64) {
+      EXPECT_EQ(encoder->encode(input.data(), size, out.data(), whole / 2, &produced, &code),
+                ChunkEncoder::Result::NoFit)
+          << name;
+    }
+  }
+}
+
 INSTANTIATE_TEST_SUITE_P(Engines, ChunkEngines, ::testing::ValuesIn(kEngines),
                          [](const auto &info) { return std::string(chunkEngineName(info.param)); });
 
