@@ -191,12 +191,28 @@ WholeChunkDecoder::WholeChunkDecoder(uint32_t chunkSize)
 WholeChunkDecoder::~WholeChunkDecoder() = default;
 
 void WholeChunkDecoder::begin(const uint8_t *chunk, uint32_t length) {
-  delivered_ = 0;
-  useZlib_ = !decodeWhole(chunk, length, buffer_.get(), capacity_, &decoded_);
-  if (useZlib_) zlib_->begin(chunk, length);
+  chunk_ = chunk;
+  length_ = length;
+  decoded_ = delivered_ = 0;
+  started_ = useZlib_ = false;
 }
 
 bool WholeChunkDecoder::decodeInto(uint8_t *output, uint32_t space, uint32_t *produced, int *code) {
+  if (!started_) {
+    started_ = true;
+    // Straight into the caller's space when the whole chunk fits there (a whole-chunk read):
+    // no copy. When it does not fit, the engine stops once the space is full, so the failed
+    // try costs no more than the bytes asked for.
+    uint32_t direct = 0;
+    if (decodeWhole(chunk_, length_, output, std::min(space, capacity_), &direct)) {
+      decoded_ = delivered_ = direct;
+      *produced = direct;
+      *code = Z_STREAM_END;
+      return true;
+    }
+    useZlib_ = !decodeWhole(chunk_, length_, buffer_.get(), capacity_, &decoded_);
+    if (useZlib_) zlib_->begin(chunk_, length_);
+  }
   if (useZlib_) return zlib_->decodeInto(output, space, produced, code);
   uint32_t step = std::min(space, decoded_ - delivered_);
   memcpy(output, buffer_.get() + delivered_, step);
@@ -206,7 +222,10 @@ bool WholeChunkDecoder::decodeInto(uint8_t *output, uint32_t space, uint32_t *pr
   return true;
 }
 
-bool WholeChunkDecoder::chunkDone() const { return useZlib_ ? zlib_->chunkDone() : delivered_ == decoded_; }
+bool WholeChunkDecoder::chunkDone() const {
+  if (!started_) return false;
+  return useZlib_ ? zlib_->chunkDone() : delivered_ == decoded_;
+}
 
 void WholeChunkDecoder::dump(const uint8_t *chunk, uint32_t length) { zlib_->dump(chunk, length); }
 

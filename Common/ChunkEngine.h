@@ -74,6 +74,7 @@ class ChunkDecoder {
   static std::unique_ptr<ChunkDecoder> create(ChunkEngine engine, uint32_t chunkSize);
   virtual ~ChunkDecoder() = default;
 
+  // Starts a chunk; its bytes must stay in place until the chunk is done.
   virtual void begin(const uint8_t *chunk, uint32_t length) = 0;
   // Decodes the chunk's next bytes into space bytes at output. Returns false when the chunk is
   // bad (*code gets zlib's result code: Z_DATA_ERROR and so on); true when output filled up or
@@ -85,9 +86,10 @@ class ChunkDecoder {
   virtual void dump(const uint8_t *chunk, uint32_t length) = 0;
 };
 
-// The base of the engines that can only decode a chunk whole: it decodes each chunk into a
-// buffer of chunkSize bytes on begin() and copies out; a chunk that does not decode whole
-// (damaged, or larger than chunkSize) goes to a zlib decoder instead.
+// The base of the engines that can only decode a chunk whole: the first decodeInto() of a
+// chunk decodes it straight into the caller's space when it fits there, else into a buffer of
+// chunkSize bytes that later calls copy from; a chunk that does not decode whole (damaged, or
+// larger than chunkSize) goes to a zlib decoder instead.
 class WholeChunkDecoder : public ChunkDecoder {
  public:
   explicit WholeChunkDecoder(uint32_t chunkSize);
@@ -105,6 +107,9 @@ class WholeChunkDecoder : public ChunkDecoder {
  private:
   std::unique_ptr<uint8_t[]> buffer_;
   uint32_t capacity_;
+  const uint8_t *chunk_ = nullptr;  // the chunk begun, decoded on the first decodeInto()
+  uint32_t length_ = 0;
+  bool started_ = false;
   uint32_t decoded_ = 0, delivered_ = 0;
   std::unique_ptr<ChunkDecoder> zlib_;
   bool useZlib_ = false;
