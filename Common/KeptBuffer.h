@@ -15,7 +15,7 @@
 
 class KeptBuffer {
  public:
-  enum Slot { kDecompressOutput, kChunkInput, kSlotCount };
+  enum Slot { kDecompressOutput, kChunkInput, kForkPending, kSlotCount };
 
   KeptBuffer(Slot slot, size_t size);
   ~KeptBuffer();

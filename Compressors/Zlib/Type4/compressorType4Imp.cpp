@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "Common/Diagnostics.h"
+#include "Common/KeptBuffer.h"
 #include "Common/commonUtils.h"
 #include "Compressors/Zlib/ByteOrder.h"
 #include "Compressors/Zlib/Type4/compressorType4.h"
@@ -76,6 +77,13 @@ struct Type4State {
   uint32_t inlineLength;  // length of the header attribute when the type-3 form was written
   uint32_t supplyOffset;  // the engine's prefix for this call
   bool consumedAll;       // the engine read the whole file and emitted every chunk
+  // Writing: every write at a position of a large fork rewrites whole segments of it, so the
+  // table is kept here and written whole after the last chunk, and chunks go out in pieces of
+  // up to kPendingLimit bytes. Chunks are read back (to give input back) from here or the fork.
+  uint8_t *table;         // chunkCount entries (sys::malloc), null until the first chunk
+  uint8_t *pending;       // chunk bytes not yet in the fork, kPendingLimit bytes of room
+  uint32_t pendingLength;
+  uint64_t pendingStart;  // fork position of pending[0]
   // Reading: a window of table entries read ahead in one call, so that a run of chunks costs
   // one read each instead of two. Null while writing, when the table is still being filled.
   uint8_t *tableWindow;
@@ -86,6 +94,8 @@ struct Type4State {
 
 // Entries read ahead at most: 4 KiB of table, 32 MiB of logical data.
 constexpr uint32_t kTableWindowEntries = 512;
+// Chunk bytes held back before they are written to the fork in one piece.
+constexpr uint32_t kPendingLimit = 1048576;
 
 int forkReadOptions() { return osSupportsDecmpfs() ? kShowCompressionOption : 0; }
 
@@ -96,6 +106,23 @@ int writeFork(Type4State *state, const void *bytes, uint32_t length, uint64_t po
     return -1;
   }
   return 0;
+}
+
+// Writes the chunk bytes held back; they stay held when the write fails.
+int flushPending(Type4State *state) {
+  if (state->pendingLength == 0) return 0;
+  if (writeFork(state, state->pending, state->pendingLength, state->pendingStart) != 0) return -1;
+  state->pendingStart += state->pendingLength;
+  state->pendingLength = 0;
+  return 0;
+}
+
+// Puts the chunks and the table in the fork: after the last chunk, and before chunks are read
+// back from it by anything other than supplyChunkType4.
+int flushChunksAndTable(Type4State *state) {
+  if (flushPending(state) != 0) return -1;
+  if (!state->table) return 0;
+  return writeFork(state, state->table, kTableEntrySize * state->chunkCount, state->dataStart + 4);
 }
 
 int emitBytesType4(void *opaque, uint64_t chunkCount, uint64_t chunkIndex, uint8_t *buffer, uint32_t length) {
@@ -115,21 +142,29 @@ int emitBytesType4(void *opaque, uint64_t chunkCount, uint64_t chunkIndex, uint8
     // The table alone must fit the budget; checked in 64 bits so that a huge count cannot wrap.
     uint64_t tableEnd = kTableEntrySize * chunkCount + 4;
     if (static_cast<int64_t>(tableEnd) > state->dataLimit) return -1;
+    state->table = static_cast<uint8_t *>(sys::calloc(static_cast<size_t>(chunkCount), kTableEntrySize));
+    if (!state->table) {
+      PLZC_ERR("%s:%d: calloc: %s\n", strerror(errno));
+      return -1;
+    }
     uint8_t count[4];
     plzc::storeLE32(count, static_cast<uint32_t>(chunkCount));
     if (writeFork(state, count, sizeof count, state->dataStart) != 0) return -1;
     state->chunkCount = static_cast<uint32_t>(chunkCount);
     state->tablePos = state->dataStart + 4;
     state->dataLength = static_cast<uint32_t>(tableEnd);
+    state->pendingStart = state->dataStart + tableEnd;
   }
   if (static_cast<int64_t>(state->dataLength) + length > state->dataLimit) return -1;
-  uint8_t entry[kTableEntrySize];
+  uint8_t *entry = state->table + kTableEntrySize * chunkIndex;
   plzc::storeLE32(entry, state->dataLength);
   plzc::storeLE32(entry + 4, length);
-  if (writeFork(state, entry, sizeof entry, state->tablePos) != 0) return -1;
   state->tablePos += kTableEntrySize;
-  if (writeFork(state, buffer + kDiskHeaderSize, length, state->dataStart + state->dataLength) != 0) return -1;
+  if (state->pendingLength + length > kPendingLimit && flushPending(state) != 0) return -1;
+  memcpy(state->pending + state->pendingLength, buffer + kDiskHeaderSize, length);
+  state->pendingLength += length;
   state->dataLength += length;
+  if (chunkIndex + 1 == state->chunkCount && flushChunksAndTable(state) != 0) return -1;
   return 0;
 }
 
@@ -140,6 +175,27 @@ uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, ui
     PLZC_ERR("%s:%d: Error: %d is greater than max chunk %d\n", static_cast<int>(chunkIndex),
              static_cast<int>(state->chunkCount));
     return 0;
+  }
+  if (state->table) {
+    // Being written: the entry is in memory, the chunk in memory or already in the fork.
+    const uint8_t *entry = state->table + kTableEntrySize * chunkIndex;
+    uint32_t chunkOffset = plzc::loadLE32(entry), chunkLength = plzc::loadLE32(entry + 4);
+    uint64_t chunkPosition = state->dataStart + chunkOffset;
+    if (chunkLength > capacity || chunkOffset == 0) {
+      PLZC_ERR("%s:%d: Error: %s: chunk %d was never written\n", handle->path, static_cast<int>(chunkIndex));
+      return kChunkError;
+    }
+    if (chunkPosition >= state->pendingStart) {
+      memcpy(buffer + state->supplyOffset, state->pending + (chunkPosition - state->pendingStart), chunkLength);
+      return chunkLength;
+    }
+    int64_t got = handle->getxattr(handle, kResourceForkXattrName, buffer + state->supplyOffset, chunkLength,
+                                   static_cast<uint32_t>(chunkPosition), forkReadOptions());
+    if (got != static_cast<int64_t>(chunkLength)) {
+      PLZC_ERR("%s:%d: fh_getxattr %s: %s\n", handle->path, strerror(errno));
+      return kChunkError;
+    }
+    return chunkLength;
   }
   // A corrupt count or table can point past what 32-bit fork positions reach.
   uint64_t entryPosition = kDataStart + 4 + kTableEntrySize * chunkIndex;
@@ -204,8 +260,8 @@ int64_t usableBlockSize(FileHandle *handle) {
 // type-3 form was written instead. 0, or the engine's result, or -1. The run's state stays in
 // *state: after the engine consumed the whole file (state->consumedAll) its chunks can be
 // read back through it.
-int doCompressType4(FileHandle *handle, int32_t level, bool allowLargeResourceForks, Type4State *out,
-                    bool *inlineForm) {
+int doCompressType4(FileHandle *handle, int32_t level, bool allowLargeResourceForks, uint8_t *pending,
+                    Type4State *out, bool *inlineForm) {
   *inlineForm = false;
   int64_t size = handle->size(handle);
   if (size < 0) return -1;
@@ -223,6 +279,7 @@ int doCompressType4(FileHandle *handle, int32_t level, bool allowLargeResourceFo
   state.dataLimit = dataLimit;
   state.fileSize = static_cast<uint64_t>(size);
   state.supplyOffset = kDiskHeaderSize;
+  state.pending = pending;
   int result = chunkingCompressor(handle, 0, kType4ChunkSize, 0, static_cast<int32_t>(kDiskHeaderSize), 0, &state,
                                   emitBytesType4, supplyChunkType4, level);
   if (result != 0) return result;
@@ -290,9 +347,18 @@ int compressFileType4(FileHandle *handle, const char *path, int64_t size, void *
   auto *context = static_cast<Type4Context *>(opaqueContext);
   if (!context->allowLargeResourceForks && size > kMaxFileSize) return -1;
   bool inlineForm = false;
+  KeptBuffer pending(KeptBuffer::kForkPending, kPendingLimit);
+  if (!pending.get()) {
+    PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
+    return -1;
+  }
   Type4State state = {};
+  struct TableOwner {
+    Type4State *state;
+    ~TableOwner() { free(state->table); }
+  } tableOwner{&state};
   if (doCompressType4(handle, static_cast<int32_t>(context->compressionLevel), context->allowLargeResourceForks != 0,
-                      &state, &inlineForm) != 0)
+                      pending.get(), &state, &inlineForm) != 0)
     return refuse(handle, &state);
   if (inlineForm) return 0;
 
