@@ -337,6 +337,24 @@ TEST_F(Type4, ReadWithoutHandleIsRefused) {
   EXPECT_THAT(GetCapturedStderr(), MatchesRegex("Compressors/Zlib/Type4/compressorType4Imp:[0-9]+: null inputFile: .*\n"));
 }
 
+TEST_F(Type4, LargeForkIsWrittenInFewPieces) {
+  // More than 1 MiB of fork: a write at a position of a large fork rewrites whole 64 KiB segments,
+  // so writing entry and chunk one by one took four segment writes per chunk. The table now
+  // goes out once and the chunks in pieces of up to 1 MiB: each segment about once, plus the
+  // start (count, table, head) and the pieces' boundaries.
+  Bytes data = compressibleBytes(96 * kChunk + 777, 41);
+  FileHandle *fh = open(data);
+  uint64_t before = sys::callCount(sys::Call::Fsetxattr);
+  ASSERT_EQ(compress(fh), 0);
+  uint64_t writes = sys::callCount(sys::Call::Fsetxattr) - before;
+  expectHeader(fh, 4, data.size());
+  expectForkLayout(fh, data);
+  size_t forkSize = attribute(fh, kResourceForkXattrName).value_or(Bytes()).size();
+  ASSERT_GT(forkSize, 1u << 20);
+  uint64_t segments = (forkSize + 65535) / 65536;
+  EXPECT_LE(writes, segments + 24) << forkSize << " bytes of fork";
+}
+
 TEST_F(Type4, FailedWritesRemoveTheFork) {
   Bytes data = repeatedBlock(150000, 18);
   FileHandle *fh = open(data);
