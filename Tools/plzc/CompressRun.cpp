@@ -74,8 +74,9 @@ class Compression {
       totals_.storedBytes += form.storedSize;
       return note("%s: already compressed (type %u)\n", path, form.type);
     }
-    bool ownFork = platform::getxattr(path, kResourceForkXattrName, nullptr, 0, 0, 0) > 0;
-    bool staleHeader = platform::getxattr(path, kDecmpfsXattrName, nullptr, 0, 0, 0) > 0;
+    // Why a file stays plain is asked only when it does: compressFile leaves a fork of the
+    // file's own, and a header of an earlier attempt, as it finds them.
+    auto hasOwnFork = [path] { return platform::getxattr(path, kResourceForkXattrName, nullptr, 0, 0, 0) > 0; };
 
     errno = 0;
     int result = compressFile(ctx_, path, nullptr);
@@ -85,7 +86,7 @@ class Compression {
       totals_.empty++;
       return note("%s: empty, left as it is\n", path);
     }
-    if (!inPlace_) return recordTocOutcome(path, size, result, error, ownFork);
+    if (!inPlace_) return recordTocOutcome(path, size, result, error, result != 0 && hasOwnFork());
 
     StoredForm after;
     if (!readStoredForm(path, &after)) return fail(path, std::string("unreadable after compression: ") + strerror(errno));
@@ -111,8 +112,9 @@ class Compression {
                   static_cast<unsigned long long>(after.logicalSize),
                   static_cast<unsigned long long>(after.storedSize), saved);
     }
-    leftPlain(path, size, result == 0 && staleHeader ? "it carries a compression header of an earlier attempt"
-                                                     : declineReason(size, ownFork));
+    bool staleHeader = result == 0 && platform::getxattr(path, kDecmpfsXattrName, nullptr, 0, 0, 0) > 0;
+    leftPlain(path, size, staleHeader ? "it carries a compression header of an earlier attempt"
+                                      : declineReason(size, result != 0 && hasOwnFork()));
   }
 
   void recordTocOutcome(const char *path, uint64_t size, int result, int error, bool ownFork) {
