@@ -103,6 +103,7 @@ class ZlibChunkEncoder final : public ChunkEncoder {
     if (ready_ && *produced == space && (*code == Z_OK || *code == Z_BUF_ERROR)) return Result::NoFit;
     return Result::Failed;
   }
+  bool ready() const override { return ready_; }
 
  private:
   z_stream stream_{};
@@ -260,6 +261,40 @@ ChunkDecoderLease::ChunkDecoderLease(ChunkEngine engine, uint32_t chunkSize) {
 
 ChunkDecoderLease::~ChunkDecoderLease() {
   if (leased_) tKeptDecoder.leased = false;
+}
+
+namespace {
+
+// The thread's kept encoder: one at a time, for the engine and level last asked for.
+struct KeptEncoder {
+  std::unique_ptr<ChunkEncoder> encoder;
+  ChunkEngine engine = ChunkEngine::Zlib;
+  int level = 0;
+  bool leased = false;
+};
+thread_local KeptEncoder tKeptEncoder;
+
+}  // namespace
+
+ChunkEncoderLease::ChunkEncoderLease(ChunkEngine engine, int level) {
+  KeptEncoder &kept = tKeptEncoder;
+  if (!kept.leased && kept.encoder && kept.engine == engine && kept.level == level) {
+    kept.leased = leased_ = true;
+    encoder_ = kept.encoder.get();
+    return;
+  }
+  own_ = ChunkEncoder::create(engine, level);
+  encoder_ = own_.get();
+  if (!kept.leased && own_->ready()) {
+    kept.encoder = std::move(own_);
+    kept.engine = engine;
+    kept.level = level;
+    kept.leased = leased_ = true;
+  }
+}
+
+ChunkEncoderLease::~ChunkEncoderLease() {
+  if (leased_) tKeptEncoder.leased = false;
 }
 
 std::unique_ptr<ChunkEncoder> makeZlibChunkEncoder(int level) { return std::make_unique<ZlibChunkEncoder>(level); }

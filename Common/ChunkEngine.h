@@ -42,6 +42,27 @@ class ChunkEncoder {
   // that case (Z_STREAM_ERROR, Z_MEM_ERROR).
   virtual Result encode(const uint8_t *input, uint32_t count, uint8_t *output, uint32_t space, uint32_t *produced,
                         int *code) = 0;
+  // False when the encoder could not be set up: every encode() then fails.
+  virtual bool ready() const = 0;
+};
+
+// An encoder of the engine and level kept by the calling thread for its later files, so that
+// compressing many small files does not build and free an encoder (libdeflate's and igzip's
+// hold hundreds of KiB of tables) for every file. An encoder's streams do not depend on what
+// it compressed before. One that is not ready is never kept; a thread that leases again while
+// holding a lease gets an encoder of its own for that lease.
+class ChunkEncoderLease {
+ public:
+  ChunkEncoderLease(ChunkEngine engine, int level);
+  ~ChunkEncoderLease();
+  ChunkEncoderLease(const ChunkEncoderLease &) = delete;
+  ChunkEncoderLease &operator=(const ChunkEncoderLease &) = delete;
+  ChunkEncoder *operator->() const { return encoder_; }
+
+ private:
+  ChunkEncoder *encoder_;
+  std::unique_ptr<ChunkEncoder> own_;  // nested, or not ready
+  bool leased_ = false;
 };
 
 class ChunkDecoder;

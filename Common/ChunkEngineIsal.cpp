@@ -69,6 +69,7 @@ class IsalChunkEncoder final : public ChunkEncoder {
     *code = Z_STREAM_ERROR;
     return Result::Failed;
   }
+  bool ready() const override { return level_ >= 0 && levelBuffer_; }
 
  private:
   int level_;

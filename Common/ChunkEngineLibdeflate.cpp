@@ -54,6 +54,7 @@ class LibdeflateChunkEncoder final : public ChunkEncoder {
     *code = Z_STREAM_END;
     return Result::Fit;
   }
+  bool ready() const override { return compressor_ != nullptr; }
 
  private:
   // The prefix tried first is this many times the space.

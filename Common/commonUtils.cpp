@@ -124,7 +124,7 @@ int chunkingCompressor(FileHandle *handle, int32_t maxChunks, uint32_t chunkSize
   // The chunk is read behind one free byte, where the stored-chunk marker goes.
   uint8_t *data = input.get() + prefixBytes + 1;
 
-  std::unique_ptr<ChunkEncoder> encoder = ChunkEncoder::create(currentChunkEngine(), level);
+  ChunkEncoderLease encoder(currentChunkEngine(), level);
   int result = 0;
   bool failed = false;
   ConsumedInput consumed = {0, 0, 0, data};

@@ -6,6 +6,7 @@
 #include <cstring>
 #include <map>
 #include <string>
+#include <thread>
 #include <tuple>
 #include <vector>
 
@@ -260,6 +261,39 @@ TEST_P(ChunkEngines, SmallSpaceFitsExactlyWhenTheWholeStreamFits) {
           << name;
     }
   }
+}
+
+// A thread's kept encoder serves its next files; a nested lease, or one at another level, gets
+// an encoder of its own, and an encoder that could not be set up is not kept.
+TEST_P(ChunkEngines, LeasedEncodersAreKeptPerThreadAndLevel) {
+  Bytes text = compressibleBytes(kChunk, 41);
+  Bytes out(kChunk);
+  uint32_t produced = 0;
+  int code = 0;
+  ChunkEncoder *first = nullptr;
+  {
+    ChunkEncoderLease lease(GetParam(), 5);
+    first = lease.operator->();
+    ChunkEncoderLease nested(GetParam(), 5);
+    EXPECT_NE(nested.operator->(), first);
+    EXPECT_EQ(nested->encode(text.data(), kChunk, out.data(), kChunk, &produced, &code), ChunkEncoder::Result::Fit);
+  }
+  {
+    ChunkEncoderLease again(GetParam(), 5);
+    EXPECT_EQ(again.operator->(), first);
+  }
+  {
+    ChunkEncoderLease bad(GetParam(), 10);
+    EXPECT_FALSE(bad->ready());
+    EXPECT_EQ(bad->encode(text.data(), kChunk, out.data(), kChunk, &produced, &code), ChunkEncoder::Result::Failed);
+  }
+  ChunkEncoderLease after(GetParam(), 5);
+  EXPECT_TRUE(after->ready());
+  EXPECT_EQ(after->encode(text.data(), kChunk, out.data(), kChunk, &produced, &code), ChunkEncoder::Result::Fit);
+  std::thread([&] {
+    ChunkEncoderLease other(GetParam(), 5);
+    EXPECT_NE(other.operator->(), after.operator->()) << "each thread keeps its own";
+  }).join();
 }
 
 INSTANTIATE_TEST_SUITE_P(Engines, ChunkEngines, ::testing::ValuesIn(kEngines),
