@@ -6,9 +6,10 @@
 # (gzip level 5, 64 KiB blocks, 2 processors), and its 64 KiB chunks deflated at level 5 and
 # inflated back by raw zlib on one and two threads (the ceiling for zlib-format chunks). Every
 # tree compressed in place is then read back with plzc cat by every engine and compared with
-# the corpus, and timed once with the default engine against raw zlib inflate on one thread.
-# Each command is run once; prints one table of throughput (MB = 10^6 bytes of logical data per
-# second) and stored/logical ratio, with the ratios to mksquashfs and to the 2-thread ceiling.
+# the corpus, and timed with the default engine against raw zlib inflate on one thread (the
+# median of three runs of each; every other command is run once). Prints one table of
+# throughput (MB = 10^6 bytes of logical data per second) and stored/logical ratio, with the
+# ratios to mksquashfs and to the 2-thread ceiling.
 #
 # Usage: Benchmarks/installBench.sh [--bench-dir DIR] [--plzc PLZC] [--work DIR]
 #   --bench-dir  the peers' tools (make_corpus.py, zlib_ceiling.c); default ../shared/bench
@@ -94,8 +95,11 @@ for engine in "${engines[@]}"; do
   o_compress[$engine]=$(stored "$work/copy")
   readBack "$work/copy"
   if [ "$engine" = libdeflate ]; then
-    # catFile of every file of the tree, in as few processes as the command line allows.
-    s_cat=$(seconds sh -c "cd '$work/copy' && xargs -0 '$plzc' cat <'$work/files' >/dev/null")
+    # catFile of every file of the tree, in as few processes as the command line allows: the
+    # median of three runs, as the raw inflate it is compared with.
+    s_cat=$(for run in 1 2 3; do
+              seconds sh -c "cd '$work/copy' && xargs -0 '$plzc' cat <'$work/files' >/dev/null"; echo
+            done | sort -n | sed -n 2p)
   fi
   rm -rf "$work/copy"
 done
@@ -105,15 +109,15 @@ s_squash=$(seconds mksquashfs "$corpus" "$work/out.sqsh" -comp gzip -Xcompressio
 o_squash=$(stat -c %s "$work/out.sqsh")
 rm -f "$work/out.sqsh"
 
-# One timed run after zlib_ceiling's own warm-up run.
-"$work/zlib_ceiling" "$corpus" 1 >"$work/ceiling.txt"
+# The median of three timed runs after zlib_ceiling's own warm-up run.
+"$work/zlib_ceiling" "$corpus" 3 >"$work/ceiling.txt"
 read -r s_ceiling1 o_ceiling < <(awk -F'\t' '/deflate 1T/ {print $2, $3}' "$work/ceiling.txt")
 read -r s_ceiling2 _ < <(awk -F'\t' '/deflate 2T/ {print $2, $3}' "$work/ceiling.txt")
 read -r s_inflate1 _ < <(awk -F'\t' '/inflate 1T/ {print $2, $3}' "$work/ceiling.txt")
 
 echo "# $(grep -m1 'model name' /proc/cpuinfo | cut -d: -f2 | xargs), $(nproc) cores, $(uname -r), load average $(cut -d' ' -f1-3 /proc/loadavg)"
 echo "# zlib $(dpkg-query -W -f '${Version}' zlib1g 2>/dev/null), libdeflate $(dpkg-query -W -f '${Version}' libdeflate0 2>/dev/null), isa-l $(dpkg-query -W -f '${Version}' libisal2 2>/dev/null), $(mksquashfs -version 2>&1 | sed -n 1p), $("$plzc" --version)"
-echo "# corpus: make_corpus.py --size-mb 256 --seed 1: $files files, $bytes bytes; one run each; MB = 10^6 bytes"
+echo "# corpus: make_corpus.py --size-mb 256 --seed 1: $files files, $bytes bytes; one run each (cat and the raw ceiling: median of 3); MB = 10^6 bytes"
 echo "# every tree compressed in place read back by libdeflate, isal and zlib: identical to the corpus"
 {
   for engine in "${engines[@]}"; do
