@@ -5,11 +5,12 @@
 # (libdeflate, the default; isal through --fast; zlib, the reference), packed with mksquashfs
 # (gzip level 5, 64 KiB blocks, 2 processors), and its 64 KiB chunks deflated at level 5 and
 # inflated back by raw zlib on one and two threads (the ceiling for zlib-format chunks). Every
-# tree compressed in place is then read back with plzc cat by every engine and compared with
-# the corpus, and timed with the default engine against raw zlib inflate on one thread (the
-# median of three runs of each; every other command is run once). Prints one table of
-# throughput (MB = 10^6 bytes of logical data per second) and stored/logical ratio, with the
-# ratios to mksquashfs and to the 2-thread ceiling.
+# tree compressed in place is then read back with plzc cat by every engine, and by zlib's
+# inflate alone (Benchmarks/zlibReadBack), and compared with the corpus; plzc cat of the tree
+# is timed with the default engine against raw zlib inflate on one thread (the median of three
+# runs of each; every other command is run once). Prints one table of throughput (MB = 10^6
+# bytes of logical data per second) and stored/logical ratio, with the ratios to mksquashfs
+# and to the 2-thread ceiling.
 #
 # Usage: Benchmarks/installBench.sh [--bench-dir DIR] [--plzc PLZC] [--work DIR]
 #   --bench-dir  the peers' tools (make_corpus.py, zlib_ceiling.c); default ../shared/bench
@@ -36,6 +37,8 @@ for f in make_corpus.py zlib_ceiling.c; do
   [ -f "$bench/$f" ] || { echo "installBench: no $f in $bench (give --bench-dir)" >&2; exit 1; }
 done
 [ -x "$plzc" ] || { echo "installBench: $plzc is not built (cmake --build build --target plzc)" >&2; exit 1; }
+zlibReadBack=$(dirname "$plzc")/../../Benchmarks/zlibReadBack
+[ -x "$zlibReadBack" ] || { echo "installBench: $zlibReadBack is not built (cmake --build build)" >&2; exit 1; }
 "$plzc" volume "$parent" >/dev/null || { "$plzc" volume "$parent" >&2; exit 1; }
 if ! command -v mksquashfs >/dev/null; then
   [ "$(id -u)" -eq 0 ] || { echo "installBench: mksquashfs is missing; install squashfs-tools" >&2; exit 1; }
@@ -78,6 +81,8 @@ readBack() {
       exit 1
     fi
   done
+  # And by zlib's inflate alone, without the library's reading code.
+  "$zlibReadBack" "$corpus" "$1" >"$work/zlib-readback.txt" || { cat "$work/zlib-readback.txt" >&2; exit 1; }
 }
 
 engines=(libdeflate isal zlib)
@@ -118,7 +123,7 @@ read -r s_inflate1 _ < <(awk -F'\t' '/inflate 1T/ {print $2, $3}' "$work/ceiling
 echo "# $(grep -m1 'model name' /proc/cpuinfo | cut -d: -f2 | xargs), $(nproc) cores, $(uname -r), load average $(cut -d' ' -f1-3 /proc/loadavg)"
 echo "# zlib $(dpkg-query -W -f '${Version}' zlib1g 2>/dev/null), libdeflate $(dpkg-query -W -f '${Version}' libdeflate0 2>/dev/null), isa-l $(dpkg-query -W -f '${Version}' libisal2 2>/dev/null), $(mksquashfs -version 2>&1 | sed -n 1p), $("$plzc" --version)"
 echo "# corpus: make_corpus.py --size-mb 256 --seed 1: $files files, $bytes bytes; one run each (cat and the raw ceiling: median of 3); MB = 10^6 bytes"
-echo "# every tree compressed in place read back by libdeflate, isal and zlib: identical to the corpus"
+echo "# every tree compressed in place read back by libdeflate, isal and zlib through plzc cat, and by zlib's inflate alone: identical to the corpus"
 {
   for engine in "${engines[@]}"; do
     echo "install $engine ${s_install[$engine]} ${o_install[$engine]}"
