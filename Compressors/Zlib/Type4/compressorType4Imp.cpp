@@ -69,7 +69,6 @@ struct Type4Context {
 struct Type4State {
   FileHandle *handle;
   uint64_t dataStart;
-  uint64_t tablePos;
   int64_t dataLimit;
   uint64_t fileSize;
   uint32_t dataLength;
@@ -80,7 +79,7 @@ struct Type4State {
   // Writing: every write at a position of a large fork rewrites whole segments of it, so the
   // table is kept here and written whole after the last chunk, and chunks go out in pieces of
   // up to kPendingLimit bytes. Chunks are read back (to give input back) from here or the fork.
-  uint8_t *table;         // chunkCount entries (sys::malloc), null until the first chunk
+  uint8_t *table;         // chunkCount entries (sys::calloc), null until the first chunk
   uint8_t *pending;       // chunk bytes not yet in the fork, kPendingLimit bytes of room
   uint32_t pendingLength;
   uint64_t pendingStart;  // fork position of pending[0]
@@ -151,18 +150,17 @@ int emitBytesType4(void *opaque, uint64_t chunkCount, uint64_t chunkIndex, uint8
     plzc::storeLE32(count, static_cast<uint32_t>(chunkCount));
     if (writeFork(state, count, sizeof count, state->dataStart) != 0) return -1;
     state->chunkCount = static_cast<uint32_t>(chunkCount);
-    state->tablePos = state->dataStart + 4;
     state->dataLength = static_cast<uint32_t>(tableEnd);
     state->pendingStart = state->dataStart + tableEnd;
   }
   if (static_cast<int64_t>(state->dataLength) + length > state->dataLimit) return -1;
-  uint8_t *entry = state->table + kTableEntrySize * chunkIndex;
-  plzc::storeLE32(entry, state->dataLength);
-  plzc::storeLE32(entry + 4, length);
-  state->tablePos += kTableEntrySize;
   if (state->pendingLength + length > kPendingLimit && flushPending(state) != 0) return -1;
   memcpy(state->pending + state->pendingLength, buffer + kDiskHeaderSize, length);
   state->pendingLength += length;
+  // The entry only once its chunk is held: an entry always names bytes that can be read back.
+  uint8_t *entry = state->table + kTableEntrySize * chunkIndex;
+  plzc::storeLE32(entry, state->dataLength);
+  plzc::storeLE32(entry + 4, length);
   state->dataLength += length;
   if (chunkIndex + 1 == state->chunkCount && flushChunksAndTable(state) != 0) return -1;
   return 0;
