@@ -232,65 +232,55 @@ void WholeChunkDecoder::dump(const uint8_t *chunk, uint32_t length) { zlib_->dum
 
 namespace {
 
-// The thread's kept decoder: one at a time, for the engine and chunk size last asked for.
-struct KeptDecoder {
-  std::unique_ptr<ChunkDecoder> decoder;
+// A thread's kept coder: one at a time, for the engine and setting (chunk size or level) last
+// asked for.
+template <typename Coder>
+struct KeptCoder {
+  std::unique_ptr<Coder> coder;
   ChunkEngine engine = ChunkEngine::Zlib;
-  uint32_t chunkSize = 0;
+  int64_t setting = -1;
   bool leased = false;
+
+  // The kept coder, now leased, when it is free and made for engine and setting; else null.
+  Coder *take(ChunkEngine wanted, int64_t wantedSetting) {
+    if (leased || !coder || engine != wanted || setting != wantedSetting) return nullptr;
+    leased = true;
+    return coder.get();
+  }
+  // Keeps made in place of the kept one and leases it, unless a lease is out; true if kept.
+  bool keep(std::unique_ptr<Coder> *made, ChunkEngine madeFor, int64_t madeSetting) {
+    if (leased) return false;
+    coder = std::move(*made);
+    engine = madeFor;
+    setting = madeSetting;
+    return leased = true;
+  }
 };
-thread_local KeptDecoder tKeptDecoder;
+thread_local KeptCoder<ChunkDecoder> tKeptDecoder;
+thread_local KeptCoder<ChunkEncoder> tKeptEncoder;
 
 }  // namespace
 
 ChunkDecoderLease::ChunkDecoderLease(ChunkEngine engine, uint32_t chunkSize) {
-  KeptDecoder &kept = tKeptDecoder;
-  if (kept.leased) {
-    own_ = ChunkDecoder::create(engine, chunkSize);
-    decoder_ = own_.get();
-    return;
-  }
-  if (!kept.decoder || kept.engine != engine || kept.chunkSize != chunkSize) {
-    kept.decoder = ChunkDecoder::create(engine, chunkSize);
-    kept.engine = engine;
-    kept.chunkSize = chunkSize;
-  }
-  kept.leased = leased_ = true;
-  decoder_ = kept.decoder.get();
+  decoder_ = tKeptDecoder.take(engine, chunkSize);
+  leased_ = decoder_ != nullptr;
+  if (leased_) return;
+  own_ = ChunkDecoder::create(engine, chunkSize);
+  decoder_ = own_.get();
+  leased_ = tKeptDecoder.keep(&own_, engine, chunkSize);
 }
 
 ChunkDecoderLease::~ChunkDecoderLease() {
   if (leased_) tKeptDecoder.leased = false;
 }
 
-namespace {
-
-// The thread's kept encoder: one at a time, for the engine and level last asked for.
-struct KeptEncoder {
-  std::unique_ptr<ChunkEncoder> encoder;
-  ChunkEngine engine = ChunkEngine::Zlib;
-  int level = 0;
-  bool leased = false;
-};
-thread_local KeptEncoder tKeptEncoder;
-
-}  // namespace
-
 ChunkEncoderLease::ChunkEncoderLease(ChunkEngine engine, int level) {
-  KeptEncoder &kept = tKeptEncoder;
-  if (!kept.leased && kept.encoder && kept.engine == engine && kept.level == level) {
-    kept.leased = leased_ = true;
-    encoder_ = kept.encoder.get();
-    return;
-  }
+  encoder_ = tKeptEncoder.take(engine, level);
+  leased_ = encoder_ != nullptr;
+  if (leased_) return;
   own_ = ChunkEncoder::create(engine, level);
   encoder_ = own_.get();
-  if (!kept.leased && own_->ready()) {
-    kept.encoder = std::move(own_);
-    kept.engine = engine;
-    kept.level = level;
-    kept.leased = leased_ = true;
-  }
+  leased_ = own_->ready() && tKeptEncoder.keep(&own_, engine, level);
 }
 
 ChunkEncoderLease::~ChunkEncoderLease() {
