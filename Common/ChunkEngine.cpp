@@ -232,59 +232,71 @@ void WholeChunkDecoder::dump(const uint8_t *chunk, uint32_t length) { zlib_->dum
 
 namespace {
 
-// A thread's kept coder: one at a time, for the engine and setting (chunk size or level) last
-// asked for.
+// A thread's kept coders: one for each of the last two engine and setting (chunk size or
+// level) pairs asked for, since reading a tree alternates between type 3's and type 4's chunk
+// sizes.
 template <typename Coder>
-struct KeptCoder {
-  std::unique_ptr<Coder> coder;
-  ChunkEngine engine = ChunkEngine::Zlib;
-  int64_t setting = -1;
-  bool leased = false;
+struct KeptCoders {
+  struct Kept {
+    std::unique_ptr<Coder> coder;
+    ChunkEngine engine = ChunkEngine::Zlib;
+    int64_t setting = -1;
+    bool leased = false;
+  };
+  Kept kept[2];
+  int replaceNext = 0;
 
-  // The kept coder, now leased, when it is free and made for engine and setting; else null.
-  Coder *take(ChunkEngine wanted, int64_t wantedSetting) {
-    if (leased || !coder || engine != wanted || setting != wantedSetting) return nullptr;
-    leased = true;
-    return coder.get();
-  }
-  // Keeps made in place of the kept one and leases it, unless a lease is out; true if kept.
-  bool keep(std::unique_ptr<Coder> *made, ChunkEngine madeFor, int64_t madeSetting) {
-    if (leased) return false;
-    coder = std::move(*made);
-    engine = madeFor;
-    setting = madeSetting;
-    return leased = true;
+  // Leases the kept coder made for engine and setting when there is one and it is free, else
+  // makes one with make() and keeps it when its slot is free and keepIt(it) says so. Sets
+  // *leased to the slot's flag when a kept coder was leased; *own holds a coder not kept.
+  template <typename Make, typename KeepIt>
+  Coder *lease(ChunkEngine engine, int64_t setting, Make make, KeepIt keepIt, std::unique_ptr<Coder> *own,
+               bool **leased) {
+    Kept *slot = nullptr;
+    for (Kept &each : kept)
+      if (each.coder && each.engine == engine && each.setting == setting) slot = &each;
+    if (slot && !slot->leased) {
+      slot->leased = true;
+      *leased = &slot->leased;
+      return slot->coder.get();
+    }
+    *own = make();
+    if (!slot) {
+      slot = &kept[replaceNext];
+      replaceNext = (replaceNext + 1) % 2;
+    }
+    if (slot->leased || !keepIt(**own)) return own->get();
+    slot->coder = std::move(*own);
+    slot->engine = engine;
+    slot->setting = setting;
+    slot->leased = true;
+    *leased = &slot->leased;
+    return slot->coder.get();
   }
 };
-thread_local KeptCoder<ChunkDecoder> tKeptDecoder;
-thread_local KeptCoder<ChunkEncoder> tKeptEncoder;
+thread_local KeptCoders<ChunkDecoder> tKeptDecoders;
+thread_local KeptCoders<ChunkEncoder> tKeptEncoders;
 
 }  // namespace
 
 ChunkDecoderLease::ChunkDecoderLease(ChunkEngine engine, uint32_t chunkSize) {
-  decoder_ = tKeptDecoder.take(engine, chunkSize);
-  leased_ = decoder_ != nullptr;
-  if (leased_) return;
-  own_ = ChunkDecoder::create(engine, chunkSize);
-  decoder_ = own_.get();
-  leased_ = tKeptDecoder.keep(&own_, engine, chunkSize);
+  decoder_ = tKeptDecoders.lease(
+      engine, chunkSize, [&] { return ChunkDecoder::create(engine, chunkSize); },
+      [](const ChunkDecoder &) { return true; }, &own_, &leased_);
 }
 
 ChunkDecoderLease::~ChunkDecoderLease() {
-  if (leased_) tKeptDecoder.leased = false;
+  if (leased_) *leased_ = false;
 }
 
 ChunkEncoderLease::ChunkEncoderLease(ChunkEngine engine, int level) {
-  encoder_ = tKeptEncoder.take(engine, level);
-  leased_ = encoder_ != nullptr;
-  if (leased_) return;
-  own_ = ChunkEncoder::create(engine, level);
-  encoder_ = own_.get();
-  leased_ = own_->ready() && tKeptEncoder.keep(&own_, engine, level);
+  encoder_ = tKeptEncoders.lease(
+      engine, level, [&] { return ChunkEncoder::create(engine, level); },
+      [](const ChunkEncoder &made) { return made.ready(); }, &own_, &leased_);
 }
 
 ChunkEncoderLease::~ChunkEncoderLease() {
-  if (leased_) tKeptEncoder.leased = false;
+  if (leased_) *leased_ = false;
 }
 
 std::unique_ptr<ChunkEncoder> makeZlibChunkEncoder(int level) { return std::make_unique<ZlibChunkEncoder>(level); }

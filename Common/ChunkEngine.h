@@ -62,7 +62,7 @@ class ChunkEncoderLease {
  private:
   ChunkEncoder *encoder_;
   std::unique_ptr<ChunkEncoder> own_;  // nested, or not ready
-  bool leased_ = false;
+  bool *leased_ = nullptr;  // the kept coder's flag, while this lease holds it
 };
 
 class ChunkDecoder;
@@ -82,7 +82,7 @@ class ChunkDecoderLease {
  private:
   ChunkDecoder *decoder_;
   std::unique_ptr<ChunkDecoder> own_;  // the nested case
-  bool leased_ = false;
+  bool *leased_ = nullptr;  // the kept coder's flag, while this lease holds it
 };
 
 // Decodes one chunk at a time, in pieces: begin() starts a chunk, decodeInto() fills the next

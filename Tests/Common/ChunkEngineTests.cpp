@@ -296,6 +296,24 @@ TEST_P(ChunkEngines, LeasedEncodersAreKeptPerThreadAndLevel) {
   }).join();
 }
 
+// Reading a tree alternates between the chunk sizes of the two types: each keeps its decoder.
+TEST_P(ChunkEngines, LeasedDecodersAreKeptForTwoChunkSizes) {
+  auto leased = [&](uint32_t chunkSize) {
+    ChunkDecoderLease lease(GetParam(), chunkSize);
+    return lease.operator->();
+  };
+  ChunkDecoder *small = leased(kChunk), *large = leased(2 * kChunk);
+  EXPECT_NE(small, large);
+  for (int round = 0; round < 3; round++) {
+    EXPECT_EQ(leased(kChunk), small);
+    EXPECT_EQ(leased(2 * kChunk), large);
+  }
+  ChunkDecoderLease holding(GetParam(), kChunk);
+  ChunkDecoderLease nested(GetParam(), kChunk);
+  EXPECT_EQ(holding.operator->(), small);
+  EXPECT_NE(nested.operator->(), small) << "a nested lease gets a decoder of its own";
+}
+
 INSTANTIATE_TEST_SUITE_P(Engines, ChunkEngines, ::testing::ValuesIn(kEngines),
                          [](const auto &info) { return std::string(chunkEngineName(info.param)); });
 
