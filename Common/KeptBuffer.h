@@ -15,7 +15,7 @@
 
 class KeptBuffer {
  public:
-  enum Slot { kDecompressOutput, kChunkInput, kForkPending, kSlotCount };
+  enum Slot { kDecompressOutput, kChunkInput, kForkPending, kForkAhead, kSlotCount };
 
   KeptBuffer(Slot slot, size_t size);
   ~KeptBuffer();

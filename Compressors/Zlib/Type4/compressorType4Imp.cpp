@@ -16,6 +16,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <optional>
 #include <vector>
 
 #include "Common/Diagnostics.h"
@@ -89,12 +90,26 @@ struct Type4State {
   uint32_t windowFirst;   // chunk index of the window's first entry
   uint32_t windowCount;   // entries held
   uint32_t wantedLast;    // last chunk the current request needs
+  // Reading from the start of the file: the fork from the chunk count on, as far as one read
+  // of kReadAhead bytes goes (count, table, first chunks; all of a small fork). Entries and
+  // chunks found there are not read again.
+  const uint8_t *ahead;
+  uint32_t aheadLength;
 };
 
 // Entries read ahead at most: 4 KiB of table, 32 MiB of logical data.
 constexpr uint32_t kTableWindowEntries = 512;
 // Chunk bytes held back before they are written to the fork in one piece.
 constexpr uint32_t kPendingLimit = 1048576;
+// Bytes read ahead from the chunk count on when a file is read from its start.
+constexpr uint32_t kReadAhead = 131072;
+
+// Copies [position, position + length) of the fork from the bytes read ahead, when they hold it.
+bool copyFromAhead(const Type4State *state, uint64_t position, uint64_t length, uint8_t *out) {
+  if (!state->ahead || position < kDataStart || position - kDataStart + length > state->aheadLength) return false;
+  memcpy(out, state->ahead + (position - kDataStart), length);
+  return true;
+}
 
 int forkReadOptions() { return osSupportsDecmpfs() ? kShowCompressionOption : 0; }
 
@@ -197,7 +212,9 @@ uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, ui
   }
   // A corrupt count or table can point past what 32-bit fork positions reach.
   uint64_t entryPosition = kDataStart + 4 + kTableEntrySize * chunkIndex;
-  if (state->tableWindow &&
+  uint8_t entry[kTableEntrySize];
+  bool entryAhead = copyFromAhead(state, entryPosition, sizeof entry, entry);
+  if (!entryAhead && state->tableWindow &&
       (chunkIndex < state->windowFirst || chunkIndex >= uint64_t{state->windowFirst} + state->windowCount)) {
     // Read the entries of this chunk and of the next ones the request needs in one call.
     uint64_t count = std::min<uint64_t>({kTableWindowEntries, state->chunkCount - chunkIndex,
@@ -210,9 +227,9 @@ uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, ui
     state->windowFirst = static_cast<uint32_t>(chunkIndex);
     state->windowCount = got > 0 ? static_cast<uint32_t>(got / kTableEntrySize) : 0;
   }
-  uint8_t entry[kTableEntrySize];
-  if (state->tableWindow && chunkIndex >= state->windowFirst &&
-      chunkIndex < uint64_t{state->windowFirst} + state->windowCount) {
+  if (entryAhead) {
+  } else if (state->tableWindow && chunkIndex >= state->windowFirst &&
+             chunkIndex < uint64_t{state->windowFirst} + state->windowCount) {
     memcpy(entry, state->tableWindow + kTableEntrySize * (chunkIndex - state->windowFirst), sizeof entry);
   } else {
     int64_t got = -1;
@@ -234,6 +251,7 @@ uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, ui
     return kChunkError;
   }
   uint64_t chunkPosition = static_cast<uint64_t>(kDataStart) + chunkOffset;
+  if (copyFromAhead(state, chunkPosition, chunkLength, buffer + state->supplyOffset)) return chunkLength;
   int64_t got = -1;
   if (chunkPosition <= 0xFFFFFFFFULL)
     got = handle->getxattr(handle, kResourceForkXattrName, buffer + state->supplyOffset, chunkLength,
@@ -383,12 +401,30 @@ int64_t doUncompressType4(FileHandle *handle, int64_t offset, uint64_t size, uin
   state.handle = handle;
   state.dataStart = kDataStart;
   uint8_t count[4];
-  int64_t got = handle->getxattr(handle, kResourceForkXattrName, count, sizeof count, kDataStart, forkReadOptions());
-  if (got != static_cast<int64_t>(sizeof count)) {
+  uint8_t *countAt = count;
+  uint64_t countRead = sizeof count;
+  // From the start of the file, one read takes the count and as much after it as kReadAhead
+  // allows; a read that does not even hold the count fails as the count's own read would.
+  std::optional<KeptBuffer> aheadBuffer;
+  if (offset == 0) {
+    aheadBuffer.emplace(KeptBuffer::kForkAhead, kReadAhead);
+    if (!aheadBuffer->get()) {
+      PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
+      return -1;
+    }
+    countAt = aheadBuffer->get();
+    countRead = kReadAhead;
+  }
+  int64_t got = handle->getxattr(handle, kResourceForkXattrName, countAt, countRead, kDataStart, forkReadOptions());
+  if (got < static_cast<int64_t>(sizeof count) || (countAt == count && got != static_cast<int64_t>(sizeof count))) {
     PLZC_ERR("%s:%d: readBytes %s: %lld: %s\n", handle->path, static_cast<long long>(got), strerror(errno));
     return -1;
   }
-  state.chunkCount = plzc::loadLE32(count);
+  if (countAt != count) {
+    state.ahead = countAt;
+    state.aheadLength = static_cast<uint32_t>(got);
+  }
+  state.chunkCount = plzc::loadLE32(countAt);
   uint8_t window[kTableWindowEntries * kTableEntrySize];
   state.tableWindow = window;
   state.wantedLast = size == 0 ? 0 : static_cast<uint32_t>(std::min<uint64_t>(

@@ -393,7 +393,8 @@ TEST_F(Decompress, ReadingAForkCostsAboutOneAttributeReadPerChunk) {
   // 40 chunks in 20 pieces. Each platform read of the fork is one Linux read of its index
   // record, plus the segments it touches that are not among the two read last. Per piece the
   // chunk count and the table entries of its chunks take one platform read each, and each
-  // chunk one more; reading the entries one by one would add one per chunk past the first.
+  // chunk one more (the first piece takes fewer: one read from the count on holds its table
+  // and chunks); reading the entries one by one would add one per chunk past the first.
   const size_t chunks = 40;
   std::string path = compressedFile("many-chunks", chunks * 65536, 4);
   std::string expected = logText(chunks * 65536, 1);
