@@ -483,23 +483,14 @@ ssize_t getValue(const Target &target, const char *name, void *value, size_t siz
         return static_cast<ssize_t>(copied);
       }
     } else if (!knownSegmented(target, names)) {
-      // A plain value is at most one Linux attribute long: one read into the scratch space
-      // gets it whole, without asking its length first.
+      // A plain value is one Linux attribute, never longer than the largest segment: one read
+      // into the scratch space gets it whole, without asking its length first.
       ssize_t got = target.get(names.plain(), scratch(), kLargestSegment);
       if (got >= 0) {
         if (position >= static_cast<uint64_t>(got)) return 0;
         size_t copied = std::min<size_t>(size, static_cast<size_t>(got) - position);
         memcpy(value, scratch() + position, copied);
         return static_cast<ssize_t>(copied);
-      }
-      if (errno == ERANGE) {  // longer than this layer writes: read it at its own length
-        std::vector<uint8_t> whole;
-        if (readPlain(target, names, &whole)) {
-          if (position >= whole.size()) return 0;
-          size_t copied = std::min<size_t>(size, whole.size() - position);
-          memcpy(value, whole.data() + position, copied);
-          return static_cast<ssize_t>(copied);
-        }
       }
       if (errno != ENODATA) return -1;
     }
