@@ -181,41 +181,24 @@ int emitBytesType4(void *opaque, uint64_t chunkCount, uint64_t chunkIndex, uint8
   return 0;
 }
 
-uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, uint32_t capacity) {
-  auto *state = static_cast<Type4State *>(opaque);
-  FileHandle *handle = state->handle;
-  if (chunkIndex >= state->chunkCount) {
-    PLZC_ERR("%s:%d: Error: %d is greater than max chunk %d\n", static_cast<int>(chunkIndex),
-             static_cast<int>(state->chunkCount));
-    return 0;
-  }
+bool inWindow(const Type4State *state, uint64_t chunkIndex) {
+  return state->tableWindow && chunkIndex >= state->windowFirst &&
+         chunkIndex < uint64_t{state->windowFirst} + state->windowCount;
+}
+
+// The table entry of chunkIndex, from wherever it is at hand: the table being written, the
+// bytes read ahead, the window (read now when it does not hold the entry), or a read of its
+// own. False after a message.
+bool tableEntry(Type4State *state, uint64_t chunkIndex, uint8_t *entry) {
   if (state->table) {
-    // Being written: the entry is in memory, the chunk in memory or already in the fork.
-    const uint8_t *entry = state->table + kTableEntrySize * chunkIndex;
-    uint32_t chunkOffset = plzc::loadLE32(entry), chunkLength = plzc::loadLE32(entry + 4);
-    uint64_t chunkPosition = state->dataStart + chunkOffset;
-    if (chunkLength > capacity || chunkOffset == 0) {
-      PLZC_ERR("%s:%d: Error: %s: chunk %d was never written\n", handle->path, static_cast<int>(chunkIndex));
-      return kChunkError;
-    }
-    if (chunkPosition >= state->pendingStart) {
-      memcpy(buffer + state->supplyOffset, state->pending + (chunkPosition - state->pendingStart), chunkLength);
-      return chunkLength;
-    }
-    int64_t got = handle->getxattr(handle, kResourceForkXattrName, buffer + state->supplyOffset, chunkLength,
-                                   static_cast<uint32_t>(chunkPosition), forkReadOptions());
-    if (got != static_cast<int64_t>(chunkLength)) {
-      PLZC_ERR("%s:%d: fh_getxattr %s: %s\n", handle->path, strerror(errno));
-      return kChunkError;
-    }
-    return chunkLength;
+    memcpy(entry, state->table + kTableEntrySize * chunkIndex, kTableEntrySize);
+    return true;
   }
+  FileHandle *handle = state->handle;
   // A corrupt count or table can point past what 32-bit fork positions reach.
   uint64_t entryPosition = kDataStart + 4 + kTableEntrySize * chunkIndex;
-  uint8_t entry[kTableEntrySize];
-  bool entryAhead = copyFromAhead(state, entryPosition, sizeof entry, entry);
-  if (!entryAhead && state->tableWindow &&
-      (chunkIndex < state->windowFirst || chunkIndex >= uint64_t{state->windowFirst} + state->windowCount)) {
+  if (copyFromAhead(state, entryPosition, kTableEntrySize, entry)) return true;
+  if (state->tableWindow && !inWindow(state, chunkIndex)) {
     // Read the entries of this chunk and of the next ones the request needs in one call.
     uint64_t count = std::min<uint64_t>({kTableWindowEntries, state->chunkCount - chunkIndex,
                                          state->wantedLast >= chunkIndex ? state->wantedLast - chunkIndex + 1 : 1});
@@ -227,35 +210,56 @@ uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, ui
     state->windowFirst = static_cast<uint32_t>(chunkIndex);
     state->windowCount = got > 0 ? static_cast<uint32_t>(got / kTableEntrySize) : 0;
   }
-  if (entryAhead) {
-  } else if (state->tableWindow && chunkIndex >= state->windowFirst &&
-             chunkIndex < uint64_t{state->windowFirst} + state->windowCount) {
-    memcpy(entry, state->tableWindow + kTableEntrySize * (chunkIndex - state->windowFirst), sizeof entry);
-  } else {
-    int64_t got = -1;
-    if (entryPosition <= 0xFFFFFFFFULL - kTableEntrySize)
-      got = handle->getxattr(handle, kResourceForkXattrName, entry, sizeof entry,
-                             static_cast<uint32_t>(entryPosition), forkReadOptions());
-    else
-      errno = EINVAL;
-    if (got != static_cast<int64_t>(sizeof entry)) {
-      PLZC_ERR("%s:%d: fh_getxattr %s: %s\n", handle->path, strerror(errno));
-      return kChunkError;
-    }
+  if (inWindow(state, chunkIndex)) {
+    memcpy(entry, state->tableWindow + kTableEntrySize * (chunkIndex - state->windowFirst), kTableEntrySize);
+    return true;
   }
+  int64_t got = -1;
+  if (entryPosition <= 0xFFFFFFFFULL - kTableEntrySize)
+    got = handle->getxattr(handle, kResourceForkXattrName, entry, kTableEntrySize,
+                           static_cast<uint32_t>(entryPosition), forkReadOptions());
+  else
+    errno = EINVAL;
+  if (got != static_cast<int64_t>(kTableEntrySize)) {
+    PLZC_ERR("%s:%d: fh_getxattr %s: %s\n", handle->path, strerror(errno));
+    return false;
+  }
+  return true;
+}
+
+uint32_t supplyChunkType4(void *opaque, uint64_t chunkIndex, uint8_t *buffer, uint32_t capacity) {
+  auto *state = static_cast<Type4State *>(opaque);
+  FileHandle *handle = state->handle;
+  if (chunkIndex >= state->chunkCount) {
+    PLZC_ERR("%s:%d: Error: %d is greater than max chunk %d\n", static_cast<int>(chunkIndex),
+             static_cast<int>(state->chunkCount));
+    return 0;
+  }
+  uint8_t entry[kTableEntrySize];
+  if (!tableEntry(state, chunkIndex, entry)) return kChunkError;
   uint32_t chunkOffset = plzc::loadLE32(entry);
   uint32_t chunkLength = plzc::loadLE32(entry + 4);
+  if (state->table && chunkOffset == 0) {
+    PLZC_ERR("%s:%d: Error: %s: chunk %d was never written\n", handle->path, static_cast<int>(chunkIndex));
+    return kChunkError;
+  }
   if (chunkLength > capacity) {
     PLZC_ERR("%s:%d: Error: %s: %d is less than needed size %d\n", handle->path, static_cast<int>(capacity),
              static_cast<int>(chunkLength));
     return kChunkError;
   }
   uint64_t chunkPosition = static_cast<uint64_t>(kDataStart) + chunkOffset;
-  if (copyFromAhead(state, chunkPosition, chunkLength, buffer + state->supplyOffset)) return chunkLength;
+  uint8_t *out = buffer + state->supplyOffset;
+  // Being written, the newest chunks are still held back in memory.
+  if (state->table && chunkPosition >= state->pendingStart) {
+    memcpy(out, state->pending + (chunkPosition - state->pendingStart), chunkLength);
+    return chunkLength;
+  }
+  if (copyFromAhead(state, chunkPosition, chunkLength, out)) return chunkLength;
   int64_t got = -1;
   if (chunkPosition <= 0xFFFFFFFFULL)
-    got = handle->getxattr(handle, kResourceForkXattrName, buffer + state->supplyOffset, chunkLength,
-                           static_cast<uint32_t>(chunkPosition), forkReadOptions());
+    got = handle->getxattr(handle, kResourceForkXattrName, out, chunkLength, static_cast<uint32_t>(chunkPosition),
+                           forkReadOptions());
   else
     errno = EINVAL;
   if (got != static_cast<int64_t>(chunkLength)) {
