@@ -159,7 +159,7 @@ TEST(DataPool, CreationFailsForANegativeSizeAndWhenMemoryRunsOut) {
   EXPECT_EQ(newDataPool(-1), nullptr);
   EXPECT_EQ(errno, EINVAL);
 
-  sys::armFault(sys::Call::Calloc, 1, ENOMEM);
+  sys::armFault(sys::Call::Malloc, 1, ENOMEM);
   CaptureStderr();
   DataPool *pool = newDataPool(1000);
   int error = errno;

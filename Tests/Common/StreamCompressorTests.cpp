@@ -457,7 +457,8 @@ TEST_F(StreamCompressor, StreamWithoutMemoryForItsDataNamesTheFile) {
   int fd = open(path.c_str(), O_RDWR | O_CREAT | O_TRUNC, 0644);
   ASSERT_GE(fd, 0);
   ASSERT_TRUE(_SQLazyInit(queue));  // its own allocations are not the ones failed here
-  sys::armFault(sys::Call::Calloc, 1, ENOMEM);
+  // The stream's record, its copies of path and prefix, then the pool's block.
+  sys::armFault(sys::Call::Malloc, 4, ENOMEM);
   CaptureStderr();
   ::StreamCompressor *stream = CreateStreamCompressor(fd, path.c_str(), dir.path().c_str(), queue, 50000);
   int error = errno;

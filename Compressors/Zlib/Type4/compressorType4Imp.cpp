@@ -79,11 +79,13 @@ struct Type4State {
   bool consumedAll;       // the engine read the whole file and emitted every chunk
   // Writing: every write at a position of a large fork rewrites whole segments of it, so the
   // table is kept here and written whole after the last chunk, and chunks go out in pieces of
-  // up to kPendingLimit bytes. Chunks are read back (to give input back) from here or the fork.
+  // up to kPendingLimit bytes. A fork that fits those bytes is built there whole (wholeFork) and
+  // written in one piece. Chunks are read back (to give input back) from here or the fork.
   uint8_t *table;         // chunkCount entries (sys::calloc), null until the first chunk
-  uint8_t *pending;       // chunk bytes not yet in the fork, kPendingLimit bytes of room
+  uint8_t *pending;       // fork bytes not yet written, kPendingLimit bytes of room
   uint32_t pendingLength;
   uint64_t pendingStart;  // fork position of pending[0]
+  bool wholeFork;         // pending holds the fork from position 0; nothing written yet
   // Reading: a window of table entries read ahead in one call, so that a run of chunks costs
   // one read each instead of two. Null while writing, when the table is still being filled.
   uint8_t *tableWindow;
@@ -122,18 +124,25 @@ int writeFork(Type4State *state, const void *bytes, uint32_t length, uint64_t po
   return 0;
 }
 
-// Writes the chunk bytes held back; they stay held when the write fails.
+// Writes the bytes held back; they stay held when the write fails. A whole fork written this
+// way is an unfinished one (zero head, table to come), as when the count is written first.
 int flushPending(Type4State *state) {
   if (state->pendingLength == 0) return 0;
   if (writeFork(state, state->pending, state->pendingLength, state->pendingStart) != 0) return -1;
   state->pendingStart += state->pendingLength;
   state->pendingLength = 0;
+  state->wholeFork = false;
   return 0;
 }
 
 // Puts the chunks and the table in the fork: after the last chunk, and before chunks are read
-// back from it by anything other than supplyChunkType4.
+// back from it by anything other than supplyChunkType4. A whole fork only takes its table: it
+// is written when head and map are in place.
 int flushChunksAndTable(Type4State *state) {
+  if (state->wholeFork) {
+    if (state->table) memcpy(state->pending + kDataStart + 4, state->table, kTableEntrySize * state->chunkCount);
+    return 0;
+  }
   if (flushPending(state) != 0) return -1;
   if (!state->table) return 0;
   return writeFork(state, state->table, kTableEntrySize * state->chunkCount, state->dataStart + 4);
@@ -161,15 +170,26 @@ int emitBytesType4(void *opaque, uint64_t chunkCount, uint64_t chunkIndex, uint8
       PLZC_ERR("%s:%d: calloc: %s\n", strerror(errno));
       return -1;
     }
-    uint8_t count[4];
-    plzc::storeLE32(count, static_cast<uint32_t>(chunkCount));
-    if (writeFork(state, count, sizeof count, state->dataStart) != 0) return -1;
     state->chunkCount = static_cast<uint32_t>(chunkCount);
     state->dataLength = static_cast<uint32_t>(tableEnd);
-    state->pendingStart = state->dataStart + tableEnd;
+    if (kDataStart + tableEnd <= kPendingLimit / 2) {
+      // Head, count and room for the table first; the chunks follow in the same buffer.
+      state->wholeFork = true;
+      state->pendingStart = 0;
+      state->pendingLength = static_cast<uint32_t>(kDataStart + tableEnd);
+      memset(state->pending, 0, state->pendingLength);
+      plzc::storeLE32(state->pending + kDataStart, static_cast<uint32_t>(chunkCount));
+    } else {
+      uint8_t count[4];
+      plzc::storeLE32(count, static_cast<uint32_t>(chunkCount));
+      if (writeFork(state, count, sizeof count, state->dataStart) != 0) return -1;
+      state->pendingStart = state->dataStart + tableEnd;
+    }
   }
   if (static_cast<int64_t>(state->dataLength) + length > state->dataLimit) return -1;
-  if (state->pendingLength + length > kPendingLimit && flushPending(state) != 0) return -1;
+  // A whole fork keeps room for its map.
+  uint32_t room = state->wholeFork ? kPendingLimit - kMapLength : kPendingLimit;
+  if (state->pendingLength + length > room && flushPending(state) != 0) return -1;
   memcpy(state->pending + state->pendingLength, buffer + kDiskHeaderSize, length);
   state->pendingLength += length;
   // The entry only once its chunk is held: an entry always names bytes that can be read back.
@@ -316,9 +336,15 @@ int doCompressType4(FileHandle *handle, int32_t level, bool allowLargeResourceFo
   plzc::storeBE32(head + 8, dataLength + 4);
   plzc::storeBE32(head + 12, kMapLength);
   plzc::storeBE32(head + kResourceDataOffset, dataLength);
-  if (writeFork(&state, head, sizeof head, 0) != 0) return -1;
-  if (writeFork(&state, kDataSuffix, sizeof kDataSuffix, kDataStart + static_cast<uint64_t>(dataLength)) != 0)
-    return -1;
+  if (state.wholeFork) {
+    memcpy(state.pending, head, sizeof head);
+    memcpy(state.pending + state.pendingLength, kDataSuffix, sizeof kDataSuffix);
+    if (writeFork(&state, state.pending, state.pendingLength + kMapLength, 0) != 0) return -1;
+  } else {
+    if (writeFork(&state, head, sizeof head, 0) != 0) return -1;
+    if (writeFork(&state, kDataSuffix, sizeof kDataSuffix, kDataStart + static_cast<uint64_t>(dataLength)) != 0)
+      return -1;
+  }
 
   // Last of all, so that a reader never finds a type-4 header before the fork is complete.
   auto *header = static_cast<uint8_t *>(sys::malloc(kDiskHeaderSize));
