@@ -2,7 +2,12 @@
 #include <libdeflate.h>
 #include <zlib.h>
 
+#include <cstring>
+#include <memory>
+#include <new>
+
 #include "Common/ChunkEngine.h"
+#include "Common/IncompressibleData.h"
 
 namespace {
 
@@ -35,6 +40,18 @@ class LibdeflateChunkEncoder final : public ChunkEncoder {
       *code = failure_;
       return Result::Failed;
     }
+    // Bytes that look random come out larger than they went in, whatever the engine: they
+    // would be compressed only to be stored raw.
+    if (space <= count && incompressible_.looksIncompressible(input, count)) {
+      *code = Z_OK;
+      return Result::NoFit;
+    }
+    if (memo_.holds(input, count)) return memo_.answer(output, space, produced, code);
+    if (space < count && count <= kMemoLimit && memo_.ready()) {
+      size_t whole = libdeflate_zlib_compress(compressor_, input, count, memo_.output.get(), count);
+      memo_.record(input, count, static_cast<uint32_t>(whole));
+      return memo_.answer(output, space, produced, code);
+    }
     // libdeflate learns that a stream does not fit only after compressing all of its input,
     // where zlib stops as soon as its output is full. When the space is a small fraction of the
     // input (the small-file form, a few KiB for up to 128 KiB), a prefix is tried first: if
@@ -59,8 +76,48 @@ class LibdeflateChunkEncoder final : public ChunkEncoder {
  private:
   // The prefix tried first is this many times the space.
   static constexpr uint32_t kProbeFactor = 4;
+  // Inputs up to this size are compressed whole when given a smaller space, and remembered.
+  static constexpr uint32_t kMemoLimit = 65536;
+
+  // The last input compressed for a space smaller than itself, with its whole stream. A small
+  // file is tried in the small-file form first (a few KiB of space); when that fails, the
+  // chunked form compresses the same bytes again for their full size. Same bytes, same level,
+  // same stream: the second call copies the first's.
+  struct Memo {
+    std::unique_ptr<uint8_t[]> input, output;
+    uint32_t count = 0;
+    uint32_t produced = 0;  // 0: the stream is longer than the input
+    bool valid = false;
+
+    bool ready() {
+      if (!input) input.reset(new (std::nothrow) uint8_t[kMemoLimit]);
+      if (!output) output.reset(new (std::nothrow) uint8_t[kMemoLimit]);
+      return input && output;
+    }
+    bool holds(const uint8_t *bytes, uint32_t length) const {
+      return valid && length == count && memcmp(input.get(), bytes, length) == 0;
+    }
+    void record(const uint8_t *bytes, uint32_t length, uint32_t streamLength) {
+      memcpy(input.get(), bytes, length);
+      count = length;
+      produced = streamLength;
+      valid = true;
+    }
+    Result answer(uint8_t *out, uint32_t space, uint32_t *written, int *code) const {
+      if (produced == 0 || produced > space) {
+        *code = Z_OK;
+        return Result::NoFit;
+      }
+      memcpy(out, output.get(), produced);
+      *written = produced;
+      *code = Z_STREAM_END;
+      return Result::Fit;
+    }
+  };
   libdeflate_compressor *compressor_ = nullptr;
   int failure_ = Z_OK;
+  IncompressibleCheck incompressible_;
+  Memo memo_;
 };
 
 class LibdeflateChunkDecoder final : public WholeChunkDecoder {

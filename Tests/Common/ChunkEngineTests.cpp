@@ -263,6 +263,44 @@ TEST_P(ChunkEngines, SmallSpaceFitsExactlyWhenTheWholeStreamFits) {
   }
 }
 
+// A small file is tried for a few KiB of space first and then, in the chunked form, for its
+// full size: whatever an encoder remembers of the first call, the second gives the stream a
+// fresh encoder gives, and other bytes of the same length are not mistaken for the first.
+TEST_P(ChunkEngines, FullSpaceAfterSmallSpaceGivesTheFreshStream) {
+  if (!chunkEngineBuilt(GetParam())) GTEST_SKIP() << "engine not built";
+  auto stream = [](ChunkEncoder &encoder, const Bytes &input, uint32_t space, ChunkEncoder::Result *result) {
+    Bytes out(input.size() + 64);
+    uint32_t produced = 0;
+    int code = 0;
+    *result = encoder.encode(input.data(), static_cast<uint32_t>(input.size()), out.data(), space, &produced, &code);
+    out.resize(*result == ChunkEncoder::Result::Fit ? produced : 0);
+    return out;
+  };
+  for (uint32_t size : {3000u, 20000u, kChunk}) {
+    Bytes text = compressibleBytes(size, 51);
+    Bytes changed = text;
+    changed[size / 2] ^= 1;
+    for (uint32_t space : {64u, 3802u, size / 3}) {
+      SCOPED_TRACE(std::to_string(size) + " bytes, first for " + std::to_string(space));
+      ChunkEncoder::Result first, again, fresh;
+      auto encoder = ChunkEncoder::create(GetParam(), 5);
+      Bytes small = stream(*encoder, text, space, &first);
+      EXPECT_EQ(small, stream(*ChunkEncoder::create(GetParam(), 5), text, space, &fresh));
+      EXPECT_EQ(first, fresh);
+      Bytes whole = stream(*encoder, text, size, &again);
+      EXPECT_EQ(whole, stream(*ChunkEncoder::create(GetParam(), 5), text, size, &fresh));
+      EXPECT_EQ(again, ChunkEncoder::Result::Fit);
+      stream(*encoder, text, space, &first);
+      EXPECT_EQ(stream(*encoder, changed, size, &again),
+                stream(*ChunkEncoder::create(GetParam(), 5), changed, size, &fresh));
+      Bytes back(size);
+      uLongf backLength = size;
+      EXPECT_EQ(uncompress(back.data(), &backLength, whole.data(), whole.size()), Z_OK);
+      EXPECT_EQ(back, text);
+    }
+  }
+}
+
 // A thread's kept encoder serves its next files; a nested lease, or one at another level, gets
 // an encoder of its own, and an encoder that could not be set up is not kept.
 TEST_P(ChunkEngines, LeasedEncodersAreKeptPerThreadAndLevel) {
