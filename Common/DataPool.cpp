@@ -29,6 +29,9 @@ constexpr int kSpinCount = 100;
 constexpr int kLockSpinCount = 64;
 
 constexpr int64_t kPoolBlockSize = 4096;
+// Bytes read from a file into the ring at once, so that the reader can start on a large file
+// before all of it is in.
+constexpr uint64_t kFileReadPiece = 1048576;
 
 // Guards a few loads and stores; never held during a copy or a wait.
 class SpinLock {
@@ -151,16 +154,22 @@ DataPool *newDataPool(int64_t size) {
 
 int64_t dataPoolSize(DataPool *pool) { return pool->size; }
 
-int64_t addDataToPool(DataPool *pool, const void *buffer, uint64_t count) {
+namespace {
+
+// The writer's loop: fills the ring's free bytes in order with fill(destination, n), which puts
+// between 1 and n bytes there and returns how many, 0 when its source has no more, or -1 (errno
+// set). Returns the bytes added, fewer than count when the source ended; -1 when fill failed
+// (what it put in before stays added) or with ENOSPC once the pool is aborted (bytes copied
+// stay in the ring but count as not added, as for addDataToPool).
+template <typename Fill>
+int64_t addToPool(DataPool *pool, uint64_t count, Fill fill) {
   if (count > pool->bytesToWrite) {
     PLZC_ERR("%s:%d: Error: attempted to write past end of pool\n");
     return -1;
   }
-  if (count == 0) return 0;
-  auto *source = static_cast<const uint8_t *>(buffer);
-  uint64_t remaining = count;
+  uint64_t added = 0;
   pool->lock.lock();
-  while (remaining > 0) {
+  while (added < count) {
     waitWhile(pool, [pool] { return pool->filled == pool->capacity && !pool->aborted; });
     if (pool->aborted) {
       pool->lock.unlock();
@@ -168,21 +177,42 @@ int64_t addDataToPool(DataPool *pool, const void *buffer, uint64_t count) {
       return -1;
     }
     uint64_t position = static_cast<uint64_t>(pool->writePos);
-    uint64_t n = std::min({pool->capacity - pool->filled, remaining, pool->capacity - position});
+    uint64_t n = std::min({pool->capacity - pool->filled, count - added, pool->capacity - position});
     pool->lock.unlock();
     // The ring's bytes from position on are free: only this side fills them, and the reader
     // does not look at them before filled says so.
-    memcpy(ring(pool) + position, source, n);
-    source += n;
-    remaining -= n;
-    pool->writePos = position + n == pool->capacity ? 0 : static_cast<int32_t>(position + n);
+    int64_t got = fill(ring(pool) + position, n);
+    if (got <= 0) {
+      pool->bytesToWrite -= added;
+      return got < 0 ? -1 : static_cast<int64_t>(added);
+    }
+    added += static_cast<uint64_t>(got);
+    position += static_cast<uint64_t>(got);
+    pool->writePos = position == pool->capacity ? 0 : static_cast<int32_t>(position);
     pool->lock.lock();
-    pool->filled += n;
+    pool->filled += static_cast<uint64_t>(got);
     signalChange(pool);
   }
   pool->lock.unlock();
-  pool->bytesToWrite -= count;
-  return static_cast<int64_t>(count);
+  pool->bytesToWrite -= added;
+  return static_cast<int64_t>(added);
+}
+
+}  // namespace
+
+int64_t addDataToPool(DataPool *pool, const void *buffer, uint64_t count) {
+  auto *source = static_cast<const uint8_t *>(buffer);
+  return addToPool(pool, count, [&source](uint8_t *destination, uint64_t n) {
+    memcpy(destination, source, n);
+    source += n;
+    return static_cast<int64_t>(n);
+  });
+}
+
+int64_t addFileDataToPool(DataPool *pool, int fd, uint64_t count) {
+  return addToPool(pool, count, [fd](uint8_t *destination, uint64_t n) {
+    return static_cast<int64_t>(sys::read(fd, destination, static_cast<size_t>(std::min(n, kFileReadPiece))));
+  });
 }
 
 void finishDataPool(DataPool *pool) {

@@ -38,6 +38,12 @@ int64_t dataPoolSize(DataPool *pool);
 // becomes aborted (bytes already copied stay in the ring, but still count as not added).
 int64_t addDataToPool(DataPool *pool, const void *buffer, uint64_t count);
 
+// Writer: like addDataToPool, but the bytes are read from fd (at its offset) straight into the
+// ring, until count bytes were added or the file ends: the bytes added, fewer than count only at
+// the end of the file; -1 with read's errno (what was read before stays added), or as
+// addDataToPool fails.
+int64_t addFileDataToPool(DataPool *pool, int fd, uint64_t count);
+
 // Writer: no more data. Silent when every announced byte was added or the pool is aborted;
 // otherwise prints "finished pool without filling it" and aborts the pool, so that the reader
 // fails instead of waiting for bytes that will never come.

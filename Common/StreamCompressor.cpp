@@ -589,23 +589,36 @@ StreamCompressor *CreateStreamCompressor(int fd, const char *path, const char *p
   return stream;
 }
 
-int64_t WriteToStreamCompressor(StreamCompressor *stream, const void *buffer, uint64_t count) {
+namespace {
+
+// Whether data may go into the stream now; a message and errno when not.
+bool acceptsData(StreamCompressor *stream) {
   if (!stream) {
     PLZC_ERR("%s:%d: Error: WriteToStreamCompressor passed NULL stream param\n");
     errno = EINVAL;
-    return -1;
+    return false;
   }
   if (int error = stream->queue->error.load(std::memory_order_relaxed)) {
     PLZC_ERR("%s:%d: Error: returning errno %d from WriteToStreamCompressor\n", error);
     errno = error;
-    return -1;
+    return false;
   }
   if (!stream->pool) {
     PLZC_ERR("%s:%d: Error: SetStreamCompressorParams not called yet\n");
     errno = EINVAL;
-    return -1;
+    return false;
   }
-  return addDataToPool(stream->pool, buffer, count);
+  return true;
+}
+
+}  // namespace
+
+int64_t WriteToStreamCompressor(StreamCompressor *stream, const void *buffer, uint64_t count) {
+  return acceptsData(stream) ? addDataToPool(stream->pool, buffer, count) : -1;
+}
+
+int64_t WriteFileToStreamCompressor(StreamCompressor *stream, int fd, uint64_t count) {
+  return acceptsData(stream) ? addFileDataToPool(stream->pool, fd, count) : -1;
 }
 
 int CloseStreamCompressor(StreamCompressor *stream) {

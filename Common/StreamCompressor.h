@@ -79,6 +79,11 @@ struct StreamQueueCounts {
 // compared, so that callers can report what the pipeline did.
 int _SQFinishWithCounts(StreamCompressorQueue *queue, StreamQueueCounts *counts);
 
+// WriteToStreamCompressor with the bytes read from fd (at its offset) straight into the
+// stream's pool, saving a copy through a buffer of the caller's: up to count bytes, fewer only
+// when the file ends first; -1 with read's errno, or as WriteToStreamCompressor fails.
+int64_t WriteFileToStreamCompressor(StreamCompressor *stream, int fd, uint64_t count);
+
 // Builds rules, compressor context, group and serial queues on the first stream; true when the
 // queue is (or already was) initialised.
 bool _SQLazyInit(StreamCompressorQueue *queue);

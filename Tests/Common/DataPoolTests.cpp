@@ -1,6 +1,8 @@
 #include "Common/DataPool.h"
 
+#include <fcntl.h>
 #include <time.h>
+#include <unistd.h>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -313,6 +315,58 @@ TEST(DataPool, SingleTransferLargerThanTheRingMeetsAWaitingPeer) {
     EXPECT_EQ(got, static_cast<int64_t>(kSize));
     EXPECT_EQ(out, bytes);
   }
+}
+
+// Bytes read from a file go straight into the ring, in order and across its wrap, while a
+// reader takes them; the add ends where the file does, and a failing read keeps what came
+// before it.
+TEST(DataPool, FileDataArrivesWholeAndStopsAtTheFilesEndOrAFailedRead) {
+  ScratchDir dir;
+  constexpr uint64_t kSize = kRing + 5 * kMiB + 12345;
+  std::vector<uint8_t> bytes = fileBytes(0, kSize);
+  int fd = open(writeFile(dir.file("large"), bytes).c_str(), O_RDONLY);
+  ASSERT_GE(fd, 0);
+  {
+    PoolRef ref(static_cast<int64_t>(kSize));
+    std::vector<uint8_t> out(kSize);
+    int64_t added = 0, got = 0;
+    Background writer([&] { added = addFileDataToPool(ref.pool, fd, kSize); });
+    Background reader([&] { got = getDataFromPool(ref.pool, out.data(), kSize); });
+    joinOrAbort(ref.pool, {&writer, &reader}, 60s);
+    EXPECT_EQ(added, static_cast<int64_t>(kSize));
+    EXPECT_EQ(got, static_cast<int64_t>(kSize));
+    EXPECT_EQ(Pattern::get().firstMismatch(out.data(), 0, kSize), -1);
+  }
+  close(fd);
+
+  // A file shorter than the pool: its bytes, and then the pool still wants the rest.
+  fd = open(writeFile(dir.file("short"), fileBytes(0, 3000)).c_str(), O_RDONLY);
+  ASSERT_GE(fd, 0);
+  {
+    PoolRef ref(5000);
+    EXPECT_EQ(addFileDataToPool(ref.pool, fd, 5000), 3000);
+    std::vector<uint8_t> out(3000);
+    EXPECT_EQ(getDataFromPool(ref.pool, out.data(), 3000), 3000);
+    EXPECT_EQ(out, fileBytes(0, 3000));
+    EXPECT_EQ(addDataToPool(ref.pool, bytes.data(), 2001), -1) << "only 2000 bytes are left to add";
+  }
+  close(fd);
+
+  // The second read fails: the first piece stays in the pool for the reader.
+  fd = open(dir.file("large").c_str(), O_RDONLY);
+  ASSERT_GE(fd, 0);
+  {
+    PoolRef ref(static_cast<int64_t>(3 * kMiB));
+    sys::armFault(sys::Call::Read, 2, EIO);
+    errno = 0;
+    EXPECT_EQ(addFileDataToPool(ref.pool, fd, 3 * kMiB), -1);
+    EXPECT_EQ(errno, EIO);
+    sys::clearFaults();
+    std::vector<uint8_t> out(kMiB);
+    EXPECT_EQ(getDataFromPool(ref.pool, out.data(), kMiB), static_cast<int64_t>(kMiB));
+    EXPECT_EQ(out, fileBytes(0, kMiB));
+  }
+  close(fd);
 }
 
 // ---- Concurrent transfers -------------------------------------------------------------------

@@ -501,11 +501,18 @@ class Installer {
       std::lock_guard<std::mutex> guard(resultsLock_);
       streamed_.push_back(job.dest);
     }
-    int64_t fed = feedData(in, job.source.c_str(), compressed, size, buffer,
-                           [&](const void *bytes, size_t count) {
-                             return WriteToStreamCompressor(stream, bytes, count) == static_cast<int64_t>(count);
-                           },
-                           cause);
+    int64_t fed;
+    if (compressed) {
+      fed = feedData(in, job.source.c_str(), compressed, size, buffer,
+                     [&](const void *bytes, size_t count) {
+                       return WriteToStreamCompressor(stream, bytes, count) == static_cast<int64_t>(count);
+                     },
+                     cause);
+    } else {
+      // Read straight into the stream's pool: no copy through our own buffer.
+      fed = WriteFileToStreamCompressor(stream, in, size);
+      if (fed < 0) *cause = std::string("cannot copy the source into the pipeline: ") + strerror(errno);
+    }
     if (CloseStreamCompressor(stream) != 0 && fed >= 0) {
       *cause = std::string("the pipeline failed: ") + strerror(errno);
       fed = -1;
