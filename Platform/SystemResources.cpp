@@ -1,5 +1,6 @@
 #include "Platform/SystemResources.h"
 
+#include <malloc.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -71,5 +72,10 @@ int physicalMemory(uint64_t *bytes) {
 
 int getDescriptorLimit(struct rlimit *limit) { return getrlimit(RLIMIT_NOFILE, limit); }
 int setDescriptorLimit(const struct rlimit *limit) { return setrlimit(RLIMIT_NOFILE, limit); }
+
+void keepFreedMemory() {
+  mallopt(M_MMAP_THRESHOLD, 32 << 20);
+  mallopt(M_TRIM_THRESHOLD, 1 << 30);
+}
 
 }  // namespace platform

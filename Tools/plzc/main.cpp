@@ -5,6 +5,7 @@
 
 #include "Cli.h"
 #include "Console.h"
+#include "Platform/SystemResources.h"
 
 #ifndef PLZC_VERSION
 #define PLZC_VERSION "unknown"
@@ -62,6 +63,7 @@ void printHelp() {
 }  // namespace
 
 int main(int argc, char **argv) {
+  platform::keepFreedMemory();
   if (argc < 2) return plzc::usageError("", "missing COMMAND");
   const char *word = argv[1];
   if (!strcmp(word, "-h") || !strcmp(word, "--help") || !strcmp(word, "help")) {
