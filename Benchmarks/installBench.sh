@@ -100,10 +100,12 @@ for engine in "${engines[@]}"; do
   o_compress[$engine]=$(stored "$work/copy")
   readBack "$work/copy"
   if [ "$engine" = libdeflate ]; then
-    # catFile of every file of the tree, in as few processes as the command line allows: the
-    # median of three runs, as the raw inflate it is compared with.
+    # catFile of every file of the tree, in as few processes as the command line allows (xargs
+    # uses 128 KiB of it unless told more): the median of three runs, as the raw inflate it is
+    # compared with.
+    line=$(xargs --show-limits </dev/null 2>&1 | awk -F: '/actually use/ {print $2 + 0; exit}')
     s_cat=$(for run in 1 2 3; do
-              seconds sh -c "cd '$work/copy' && xargs -0 '$plzc' cat <'$work/files' >/dev/null"; echo
+              seconds sh -c "cd '$work/copy' && xargs -0 -s '$line' '$plzc' cat <'$work/files' >/dev/null"; echo
             done | sort -n | sed -n 2p)
   fi
   rm -rf "$work/copy"

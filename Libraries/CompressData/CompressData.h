@@ -22,3 +22,10 @@ int decompressData(FileHandle *fh, DecompressWriter writer, void *writerCtx);
 // catFile, telling its caller what happened: 0 when the whole file was written to standard
 // output, -1 after the failure was reported on standard error.
 int catFileStatus(const char *path, int forceUserSpace);
+
+namespace platform {
+struct Stat;
+}
+// catFileStatus for a caller that has just called platform::stat on path itself: st is that
+// result, used instead of a second stat.
+int catFileStatusOf(const char *path, const platform::Stat &st, int forceUserSpace);

@@ -261,6 +261,10 @@ int catFileStatus(const char *path, int forceUserSpace) {
     PLZC_ERR("%s:%d: stat(%s): %s\n", path, strerror(errno));
     return -1;
   }
+  return catFileStatusOf(path, st, forceUserSpace);
+}
+
+int catFileStatusOf(const char *path, const platform::Stat &st, int forceUserSpace) {
   if ((st.st_flags & kCompressedFlag) && (!osSupportsDecmpfs() || forceUserSpace)) {
     FileHandle *fh = openFile(path, path, O_RDONLY);
     if (!fh) {
