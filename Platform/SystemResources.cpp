@@ -76,6 +76,10 @@ int setDescriptorLimit(const struct rlimit *limit) { return setrlimit(RLIMIT_NOF
 void keepFreedMemory() {
   mallopt(M_MMAP_THRESHOLD, 32 << 20);
   mallopt(M_TRIM_THRESHOLD, 1 << 30);
+  // One arena: a block is freed by another thread than the one that allocated it (a file's data
+  // pool, filled by the caller's thread, is released by the pipeline's), and with an arena per
+  // thread the memory freed never serves the next allocation.
+  mallopt(M_ARENA_MAX, 1);
 }
 
 }  // namespace platform

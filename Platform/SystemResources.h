@@ -20,11 +20,12 @@ uint64_t cgroupMemoryLimit(const char *procSelfCgroup, const char *cgroupRoot);
 int getDescriptorLimit(struct rlimit *limit);
 int setDescriptorLimit(const struct rlimit *limit);
 
-// Tells the C library to keep memory that is freed for later allocations instead of giving it
-// back to the system at once, and to serve blocks of up to 32 MiB from that memory: a program
-// that moves file data through blocks of every size otherwise pays a page fault (and the
-// kernel's clearing of the page) for every 4 KiB of each new block, about as much as filling
-// it. For programs, not for the library: it changes the whole process's allocator.
+// Tells the C library to keep memory that is freed for later allocations, by any thread,
+// instead of giving it back to the system at once, and to serve blocks of up to 32 MiB from
+// that memory: a program that moves file data through blocks of every size otherwise pays a
+// page fault (and the kernel's clearing of the page) for every 4 KiB of each new block, about
+// as much as filling it. For programs, not for the library: it changes the whole process's
+// allocator.
 void keepFreedMemory();
 
 }  // namespace platform
