@@ -85,7 +85,7 @@ struct Type4State {
   uint8_t *pending;       // fork bytes not yet written, kPendingLimit bytes of room
   uint32_t pendingLength;
   uint64_t pendingStart;  // fork position of pending[0]
-  bool wholeFork;         // pending holds the fork from position 0; nothing written yet
+  bool wholeFork;         // pending holds the fork from position 0; only the count written yet
   // Reading: a window of table entries read ahead in one call, so that a run of chunks costs
   // one read each instead of two. Null while writing, when the table is still being filled.
   uint8_t *tableWindow;
@@ -172,6 +172,12 @@ int emitBytesType4(void *opaque, uint64_t chunkCount, uint64_t chunkIndex, uint8
     }
     state->chunkCount = static_cast<uint32_t>(chunkCount);
     state->dataLength = static_cast<uint32_t>(tableEnd);
+    // The count goes out at once, whatever follows: a file whose fork exists is one that
+    // something is compressing (or has compressed), and is left alone by anyone else who
+    // reaches it under another name meanwhile.
+    uint8_t count[4];
+    plzc::storeLE32(count, static_cast<uint32_t>(chunkCount));
+    if (writeFork(state, count, sizeof count, state->dataStart) != 0) return -1;
     if (kDataStart + tableEnd <= kPendingLimit / 2) {
       // Head, count and room for the table first; the chunks follow in the same buffer.
       state->wholeFork = true;
@@ -180,9 +186,6 @@ int emitBytesType4(void *opaque, uint64_t chunkCount, uint64_t chunkIndex, uint8
       memset(state->pending, 0, state->pendingLength);
       plzc::storeLE32(state->pending + kDataStart, static_cast<uint32_t>(chunkCount));
     } else {
-      uint8_t count[4];
-      plzc::storeLE32(count, static_cast<uint32_t>(chunkCount));
-      if (writeFork(state, count, sizeof count, state->dataStart) != 0) return -1;
       state->pendingStart = state->dataStart + tableEnd;
     }
   }
