@@ -78,9 +78,14 @@ class Compression {
     // file's own, and a header of an earlier attempt, as it finds them.
     auto hasOwnFork = [path] { return platform::getxattr(path, kResourceForkXattrName, nullptr, 0, 0, 0) > 0; };
 
+    // A file renamed while the tree is walked can reach two workers under two names: one at a
+    // time per file (the one stat above names it), so that the second finds the first's work
+    // done instead of compressing the file under it and undoing what the first stored.
+    FileLock *lock = inPlace_ ? PLZCLockFileIno(static_cast<int32_t>(before.st.st_dev), before.st.st_ino) : nullptr;
     errno = 0;
     int result = compressFile(ctx_, path, nullptr);
     int error = errno;
+    if (lock) PLZCUnlockFile(lock);
 
     if (size == 0) {
       totals_.empty++;
