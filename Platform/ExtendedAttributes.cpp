@@ -351,7 +351,7 @@ bool readPlain(const Target &target, const Names &names, std::vector<uint8_t> *v
 }
 
 // The state behind an XattrReadCache: the last two segments read, and the value last found
-// segmented (its plain form need not be tried first).
+// segmented with its index (neither its plain form nor its index is read again).
 struct ReadCacheState {
   struct Slot {
     std::string key;
@@ -363,6 +363,7 @@ struct ReadCacheState {
   int next = 0;
   std::string segmentedValue;
   uint64_t segmentedEpoch = 0;
+  Index segmentedIndex{};
 };
 thread_local ReadCacheState *tReadCache = nullptr;
 
@@ -398,18 +399,22 @@ ssize_t readSegmentForCopy(const Target &target, const Names &names, uint32_t ge
   return got;
 }
 
-// Whether the thread's read cache saw this value segmented since the last write.
-bool knownSegmented(const Target &target, const Names &names) {
+// The index of this value when the thread's read cache saw it segmented since the last write
+// of this process, else null.
+const Index *knownSegmented(const Target &target, const Names &names) {
   ReadCacheState *cache = tReadCache;
-  return cache && cache->segmentedEpoch == gWriteEpoch.load(std::memory_order_relaxed) &&
-         cache->segmentedValue == target.identity() + '\n' + names.index();
+  bool known = cache && cache->segmentedEpoch == gWriteEpoch.load(std::memory_order_relaxed) &&
+               cache->segmentedValue == target.identity() + '\n' + names.index();
+  return known ? &cache->segmentedIndex : nullptr;
 }
 
-void rememberSegmented(const Target &target, const Names &names, bool segmented) {
+// Remembers the value as segmented with this index, or (null) as not known to be.
+void rememberSegmented(const Target &target, const Names &names, const Index *index) {
   ReadCacheState *cache = tReadCache;
   if (!cache) return;
-  cache->segmentedValue = segmented ? target.identity() + '\n' + names.index() : std::string();
+  cache->segmentedValue = index ? target.identity() + '\n' + names.index() : std::string();
   cache->segmentedEpoch = gWriteEpoch.load(std::memory_order_relaxed);
+  if (index) cache->segmentedIndex = *index;
 }
 
 // Copies [position, position + count) of a segmented value into `out`. Returns 0, -1 with errno,
@@ -495,18 +500,17 @@ ssize_t getValue(const Target &target, const char *name, void *value, size_t siz
       if (errno != ENODATA) return -1;
     }
 
+    // A positional read of a value the cache knows goes on with the index it read first: the
+    // value as it was then, for as long as its segments are there (see readSegmented).
     Index index;
-    int found = readIndex(target, names, &index);
-    if (found == 0 && knownSegmented(target, names)) {
-      // Replaced by a plain value since the cache saw it: start over with the plain form.
-      rememberSegmented(target, names, false);
-      continue;
-    }
+    const Index *known = fork && position != 0 ? knownSegmented(target, names) : nullptr;
+    int found = known ? 1 : readIndex(target, names, &index);
+    if (known) index = *known;
     if (found <= 0) {
       if (found == 0) errno = ENODATA;
       return -1;
     }
-    if (fork && position != 0) rememberSegmented(target, names, true);
+    if (fork) rememberSegmented(target, names, &index);
     if (!value) return static_cast<ssize_t>(index.length);
     uint64_t count;
     if (!fork) {
@@ -522,6 +526,8 @@ ssize_t getValue(const Target &target, const char *name, void *value, size_t siz
     int result = readSegmented(target, names, index, static_cast<uint8_t *>(value), position, count);
     if (result < 0) return -1;
     if (result == 0) return static_cast<ssize_t>(count);
+    // Replaced meanwhile, by a segmented value or a plain one: start over, reading both forms.
+    rememberSegmented(target, names, nullptr);
   }
   errno = EAGAIN;
   return -1;

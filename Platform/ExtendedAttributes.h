@@ -82,13 +82,16 @@ struct XattrSegmentCounters {
 XattrSegmentCounters &xattrSegmentCounters();
 
 // While an object of this class lives, positional reads of a segmented resource fork made by
-// its thread keep the last segments they read and serve later reads from them, so that a
-// reader going through a fork in small pieces (a chunk table entry, then the chunk, then the
-// next entry) reads each segment about once. The value's index record is still read on every
-// call, so a value replaced meanwhile is never served from the cache, and any attribute write
-// or removal made by this process empties it. (Another process overwriting the value in place
-// during the read gives a torn read with or without the cache, as with a plain file.) Meant for one reader going through one file, as
-// decompression does; a second object on the same thread while one lives does nothing.
+// its thread keep the value's index record and the last segments they read, and serve later
+// reads from them, so that a reader going through a fork in small pieces (a chunk table entry,
+// then the chunk, then the next entry) reads the index once and each segment about once. The
+// reader goes on with the value as it was at its first read for as long as that value's
+// segments are there: a value that another process replaces meanwhile is seen from the first
+// segment that is no longer found (the remover takes them all), not before. Any attribute write
+// or removal made by this process empties the cache. (Another process overwriting the value in
+// place during the read gives a torn read with or without the cache, as with a plain file.)
+// Meant for one reader going through one file, as decompression does; a second object on the
+// same thread while one lives does nothing.
 class XattrReadCache {
  public:
   XattrReadCache();

@@ -196,8 +196,11 @@ TEST_F(ExtendedAttributes, ReadCacheServesRepeatedReadsAndSeesEveryChange) {
 
   platform::XattrReadCache cache;
   platform::xattrSegmentCounters() = {};
-  for (size_t position = 100; position < kPiece - 8; position += 997) EXPECT_EQ(readAt(position), modelAt(fork, position));
+  EXPECT_EQ(readAt(100), modelAt(fork, 100));
+  uint64_t callsAfterFirst = sys::callCount(sys::Call::Getxattr);
+  for (size_t position = 1097; position < kPiece - 8; position += 997) EXPECT_EQ(readAt(position), modelAt(fork, position));
   EXPECT_EQ(platform::xattrSegmentCounters().reads, 1u) << "one segment read, the rest from the cache";
+  EXPECT_EQ(sys::callCount(sys::Call::Getxattr), callsAfterFirst) << "neither index nor segment read again";
 
   // Our own write in place, inside the same generation of the value.
   fork[200] ^= 0xFF;
@@ -215,10 +218,14 @@ TEST_F(ExtendedAttributes, ReadCacheServesRepeatedReadsAndSeesEveryChange) {
   int status = -1;
   ASSERT_EQ(waitpid(child, &status, 0), child);
   ASSERT_EQ(status, 0);
-  EXPECT_EQ(readAt(196), modelAt(replacement, 196));
+  // The reader goes on with the value it was reading while it holds the segment asked for, and
+  // finds the new value at the first segment that is gone; from then on it reads the new one.
+  EXPECT_EQ(readAt(196), modelAt(fork, 196));
   EXPECT_EQ(readAt(3 * kPiece + 5), modelAt(replacement, 3 * kPiece + 5));
+  EXPECT_EQ(readAt(196), modelAt(replacement, 196));
 
-  // And then with a plain value, which the cache knew as segmented.
+  // And then with a plain value, which the cache knew as segmented: past its end at the first
+  // segment gone, then its bytes.
   std::vector<uint8_t> small = randomBytes(1000, 11);
   child = ::fork();
   if (child == 0)
@@ -228,7 +235,29 @@ TEST_F(ExtendedAttributes, ReadCacheServesRepeatedReadsAndSeesEveryChange) {
               : 1);
   ASSERT_EQ(waitpid(child, &status, 0), child);
   ASSERT_EQ(status, 0);
+  EXPECT_EQ(platform::getxattr(path.c_str(), kFork, bytes, 8, static_cast<uint32_t>(5 * kPiece), 0), 0);
   EXPECT_EQ(readAt(500), modelAt(small, 500));
+}
+
+TEST_F(ExtendedAttributes, EachReadCacheStartsFromTheValueAsItIsThen) {
+  std::vector<uint8_t> fork = randomBytes(4 * kPiece, 12), tail = randomBytes(8, 13);
+  writePiece(fork, 0, fork.size());
+  uint8_t bytes[8];
+  {
+    platform::XattrReadCache cache;
+    ASSERT_EQ(platform::getxattr(path.c_str(), kFork, bytes, 8, 1000, 0), 8);
+    EXPECT_EQ(0, memcmp(bytes, fork.data() + 1000, 8));
+  }
+  // Another process extends the value in place: same segments, a longer length.
+  pid_t child = ::fork();
+  if (child == 0)
+    _exit(platform::setxattr(path.c_str(), kFork, tail.data(), tail.size(), 4 * kPiece + 10, 0) == 0 ? 0 : 1);
+  int status = -1;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  ASSERT_EQ(status, 0);
+  platform::XattrReadCache cache;
+  ASSERT_EQ(platform::getxattr(path.c_str(), kFork, bytes, 8, 4 * kPiece + 10, 0), 8) << "the length read anew";
+  EXPECT_EQ(0, memcmp(bytes, tail.data(), 8));
 }
 
 TEST_F(ExtendedAttributes, WholeReplacementSwitchesBetweenFormsWithoutLeftovers) {

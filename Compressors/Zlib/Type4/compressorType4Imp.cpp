@@ -92,9 +92,9 @@ struct Type4State {
   uint32_t windowFirst;   // chunk index of the window's first entry
   uint32_t windowCount;   // entries held
   uint32_t wantedLast;    // last chunk the current request needs
-  // Reading from the start of the file: the fork from the chunk count on, as far as one read
-  // of kReadAhead bytes goes (count, table, first chunks; all of a small fork). Entries and
-  // chunks found there are not read again.
+  // Reading from the start of the file: the fork as far as one read of kReadAhead bytes from
+  // its start goes (count, table, first chunks; all of a small fork), from the chunk count on.
+  // Entries and chunks found there are not read again.
   const uint8_t *ahead;
   uint32_t aheadLength;
 };
@@ -103,7 +103,7 @@ struct Type4State {
 constexpr uint32_t kTableWindowEntries = 512;
 // Chunk bytes held back before they are written to the fork in one piece.
 constexpr uint32_t kPendingLimit = 1048576;
-// Bytes read ahead from the chunk count on when a file is read from its start.
+// Bytes of the fork read ahead from its start when a file is read from its start.
 constexpr uint32_t kReadAhead = 131072;
 
 // Copies [position, position + length) of the fork from the bytes read ahead, when they hold it.
@@ -435,27 +435,31 @@ int64_t doUncompressType4(FileHandle *handle, int64_t offset, uint64_t size, uin
   state.dataStart = kDataStart;
   uint8_t count[4];
   uint8_t *countAt = count;
-  uint64_t countRead = sizeof count;
-  // From the start of the file, one read takes the count and as much after it as kReadAhead
-  // allows; a read that does not even hold the count fails as the count's own read would.
+  // From the start of the file, one read takes the fork from its start (whole segments, copied
+  // once), the count and as much after it as kReadAhead allows; a read that does not even hold
+  // the count fails as the count's own read would.
   std::optional<KeptBuffer> aheadBuffer;
+  int64_t got;
   if (offset == 0) {
     aheadBuffer.emplace(KeptBuffer::kForkAhead, kReadAhead);
     if (!aheadBuffer->get()) {
       PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
       return -1;
     }
-    countAt = aheadBuffer->get();
-    countRead = kReadAhead;
+    got = handle->getxattr(handle, kResourceForkXattrName, aheadBuffer->get(), kReadAhead, 0, forkReadOptions());
+    if (got >= static_cast<int64_t>(kDataStart + sizeof count)) {
+      countAt = aheadBuffer->get() + kDataStart;
+      state.ahead = countAt;
+      state.aheadLength = static_cast<uint32_t>(got - kDataStart);
+    } else if (got >= 0) {
+      got = std::max<int64_t>(got - kDataStart, 0);
+    }
+  } else {
+    got = handle->getxattr(handle, kResourceForkXattrName, count, sizeof count, kDataStart, forkReadOptions());
   }
-  int64_t got = handle->getxattr(handle, kResourceForkXattrName, countAt, countRead, kDataStart, forkReadOptions());
   if (got < static_cast<int64_t>(sizeof count) || (countAt == count && got != static_cast<int64_t>(sizeof count))) {
     PLZC_ERR("%s:%d: readBytes %s: %lld: %s\n", handle->path, static_cast<long long>(got), strerror(errno));
     return -1;
-  }
-  if (countAt != count) {
-    state.ahead = countAt;
-    state.aheadLength = static_cast<uint32_t>(got);
   }
   state.chunkCount = plzc::loadLE32(countAt);
   uint8_t window[kTableWindowEntries * kTableEntrySize];
