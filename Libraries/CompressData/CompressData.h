@@ -12,7 +12,11 @@
 // reported and ends the digest early, which is still returned.
 int checksumFile(const char *path, uint8_t digest[16]);
 
-// Receives the logical data in order, in pieces of at most 128 KiB: -1 stops with failure.
+// The largest piece a DecompressWriter receives: 1 MiB, so that a large file costs few writes.
+constexpr int64_t kDecompressPieceSize = 1048576;
+
+// Receives the logical data in order, in pieces of at most kDecompressPieceSize bytes: -1 stops
+// with failure.
 typedef int (*DecompressWriter)(int64_t offset, const void *bytes, int64_t count, void *writerCtx);
 
 // Hands the logical data of the compressed file behind fh to writer. 0 when every byte went

@@ -23,7 +23,7 @@ static constexpr char kSourcePath[] = "Libraries/CompressData/Decompress";
 
 namespace {
 
-constexpr int64_t kPieceSize = 131072;
+constexpr int64_t kPieceSize = kDecompressPieceSize;
 
 // -1 until known; every thread stores the same answer.
 std::atomic<int> isRoot{-1};

@@ -18,8 +18,6 @@ namespace plzcfuzz {
 
 namespace {
 
-constexpr int64_t kPieceLimit = 131072;
-
 struct WriterState {
   Decoded *decoded;
   uint64_t limit;
@@ -30,7 +28,7 @@ int checkingWriter(int64_t offset, const void *bytes, int64_t count, void *conte
   auto *state = static_cast<WriterState *>(context);
   FUZZ_CHECK(offset >= 0 && static_cast<uint64_t>(offset) == state->offset, "piece at offset %lld, expected %llu",
              static_cast<long long>(offset), static_cast<unsigned long long>(state->offset));
-  FUZZ_CHECK(count >= 1 && count <= kPieceLimit, "piece of %lld bytes", static_cast<long long>(count));
+  FUZZ_CHECK(count >= 1 && count <= kDecompressPieceSize, "piece of %lld bytes", static_cast<long long>(count));
   state->offset += static_cast<uint64_t>(count);
   if (state->offset > state->limit) {
     state->decoded->stopped = true;

@@ -27,7 +27,7 @@ struct Decoded {
 // when an engine's result or bytes differ from zlib's.
 //
 // Runs decompressData on handle with a writer that checks every piece (each follows the last
-// without a gap and holds 1 to 131072 bytes) and keeps at most limit bytes. When header (the
+// without a gap and holds 1 to kDecompressPieceSize bytes) and keeps at most limit bytes. When header (the
 // "com.tavix.decmpfs" value, or NULL when unknown) holds a whole header, a success must have
 // produced exactly its logical size; a size that is negative as a signed 64-bit number
 // produces nothing.
