@@ -1,6 +1,7 @@
 #include "Platform/Syscalls.h"
 
 #include <fcntl.h>
+#include <sys/sendfile.h>
 #include <sys/statfs.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -136,6 +137,7 @@ void *malloc(size_t size) { PLZC_WRAP(Malloc, nullptr, ::malloc(size)); }
 void *realloc(void *block, size_t size) { PLZC_WRAP(Malloc, nullptr, ::realloc(block, size)); }
 char *strdup(const char *text) { PLZC_WRAP(Malloc, nullptr, ::strdup(text)); }
 void *calloc(size_t count, size_t size) { PLZC_WRAP(Calloc, nullptr, ::calloc(count, size)); }
+ssize_t sendfile(int out, int in, size_t count) { PLZC_WRAP_RESTARTING(Sendfile, ::sendfile(out, in, nullptr, count)); }
 int dup(int fd) { PLZC_WRAP(Dup, -1, ::dup(fd)); }
 off_t lseek(int fd, off_t offset, int whence) { PLZC_WRAP(Lseek, -1, ::lseek(fd, offset, whence)); }
 int chmod(const char *path, mode_t mode) { PLZC_WRAP(Chmod, -1, ::chmod(path, mode)); }

@@ -6,7 +6,7 @@
 // the library can then be driven on a real file system, without mocks of whole components.
 //
 // Two Linux rules are kept here, once for the whole library:
-// - open, read, write, pread, pwrite, truncate and ftruncate are restarted when a signal
+// - open, read, write, pread, pwrite, sendfile, truncate and ftruncate are restarted when a signal
 //   interrupts them (EINTR) before they transferred anything. Regular files on local file
 //   systems never do that, but the paths the library is given may name FIFOs or devices, and
 //   standard output may be a pipe. An injected EINTR is restarted the same way (the restart is
@@ -31,7 +31,7 @@ enum class Call : int {
   Stat, Lstat, Fstat, Statfs, Fstatfs,
   Getxattr, Lgetxattr, Fgetxattr, Setxattr, Lsetxattr, Fsetxattr,
   Removexattr, Lremovexattr, Fremovexattr, Listxattr, Llistxattr, Flistxattr,
-  Futimes, Rename, Mkdir, Realpath, Malloc, Calloc, Dup, Lseek, Chmod, Utimes,
+  Futimes, Rename, Mkdir, Realpath, Malloc, Calloc, Dup, Lseek, Chmod, Utimes, Sendfile,
   Count
 };
 
@@ -84,6 +84,11 @@ int chmod(const char *path, mode_t mode);
 // chmod of an open file; counted and failed as a chmod call.
 int fchmod(int fd, mode_t mode);
 int utimes(const char *path, const struct timeval times[2]);
+// Copies up to count bytes from the current position of in (a regular file) to out inside the
+// kernel, advancing in's position: bytes copied, 0 at the end of in, or -1 with errno (EINVAL
+// when out cannot take data this way: a terminal, a file open for appending). Restarted on
+// EINTR before anything was copied.
+ssize_t sendfile(int out, int in, size_t count);
 
 // write and pwrite of every byte, through the wrappers above: a short write (a volume filling
 // up) or EINTR is continued until all count bytes are written or a call fails, so that the

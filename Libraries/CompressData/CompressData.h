@@ -12,8 +12,9 @@
 // reported and ends the digest early, which is still returned.
 int checksumFile(const char *path, uint8_t digest[16]);
 
-// The largest piece a DecompressWriter receives: 1 MiB, so that a large file costs few writes.
-constexpr int64_t kDecompressPieceSize = 1048576;
+// The largest piece a DecompressWriter receives. A piece is handed over only when every chunk
+// in it decoded: the data before a damaged chunk reaches the writer, up to this granularity.
+constexpr int64_t kDecompressPieceSize = 131072;
 
 // Receives the logical data in order, in pieces of at most kDecompressPieceSize bytes: -1 stops
 // with failure.

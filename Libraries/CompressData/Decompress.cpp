@@ -24,6 +24,8 @@ static constexpr char kSourcePath[] = "Libraries/CompressData/Decompress";
 namespace {
 
 constexpr int64_t kPieceSize = kDecompressPieceSize;
+// Bytes asked of one sendfile call: the most Linux copies in one.
+constexpr size_t kSendfileLimit = 0x7ffff000;
 
 // -1 until known; every thread stores the same answer.
 std::atomic<int> isRoot{-1};
@@ -45,6 +47,28 @@ int _decompressWriter(int64_t offset, const void *bytes, int64_t count, void *wr
 int catWriter(int64_t, const void *bytes, int64_t count, void *) {
   ssize_t ignored = sys::write(1, bytes, static_cast<size_t>(count));
   (void)ignored;
+  return 0;
+}
+
+// Reads fd to its end and writes what it reads to standard output (whose failures, like
+// catWriter's, are not the reader's), counting it off *remaining. 0, or -1 after a message.
+int copyToOutput(int fd, int64_t *remaining) {
+  KeptBuffer blockBuffer(KeptBuffer::kDecompressOutput, kPieceSize);
+  uint8_t *block = blockBuffer.get();
+  if (!block) {
+    PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
+    return -1;
+  }
+  ssize_t got;
+  while ((got = sys::read(fd, block, kPieceSize)) > 0) {
+    ssize_t ignored = sys::write(1, block, static_cast<size_t>(got));
+    (void)ignored;
+    *remaining -= got;
+  }
+  if (got == -1) {
+    PLZC_ERR("%s:%d: read: %s\n", strerror(errno));
+    return -1;
+  }
   return 0;
 }
 
@@ -283,25 +307,13 @@ int catFileStatusOf(const char *path, const platform::Stat &st, int forceUserSpa
     PLZC_ERR("%s:%d: open(%s): %s\n", path, strerror(errno));
     return -1;
   }
-  KeptBuffer blockBuffer(KeptBuffer::kDecompressOutput, kPieceSize);
-  uint8_t *block = blockBuffer.get();
-  if (!block) {
-    PLZC_ERR("%s:%d: malloc: %s\n", strerror(errno));
-    sys::close(fd);
-    return -1;
-  }
   int64_t remaining = st.st.st_size;
+  // The kernel copies the data to standard output without bringing it here. Where standard
+  // output does not take it that way (a terminal, a file open for appending), or a copy fails
+  // halfway, the reads go on from where it stopped and report what failed.
   ssize_t got;
-  while ((got = sys::read(fd, block, kPieceSize)) > 0) {
-    ssize_t ignored = sys::write(1, block, static_cast<size_t>(got));
-    (void)ignored;
-    remaining -= got;
-  }
-  int result = 0;
-  if (got == -1) {
-    PLZC_ERR("%s:%d: read: %s\n", strerror(errno));
-    result = -1;
-  }
+  while ((got = sys::sendfile(1, fd, kSendfileLimit)) > 0) remaining -= got;
+  int result = got == 0 ? 0 : copyToOutput(fd, &remaining);
   sys::close(fd);
   if (remaining != 0) {
     PLZC_ERR("%s:%d: Error: didn't read all of '%s'\n", path);

@@ -77,7 +77,7 @@ const char *callName(sys::Call call) {
       "truncate", "fsync",     "stat",      "lstat",     "fstat",        "statfs",       "fstatfs",      "getxattr",
       "lgetxattr", "fgetxattr", "setxattr", "lsetxattr",    "fsetxattr",    "removexattr",  "lremovexattr",
       "fremovexattr", "listxattr", "llistxattr", "flistxattr", "futimes", "rename", "mkdir",
-      "realpath", "malloc",    "calloc",    "dup",          "lseek",        "chmod",        "utimes",
+      "realpath", "malloc",    "calloc",    "dup",          "lseek",        "chmod",        "utimes",       "sendfile",
   };
   static_assert(sizeof kNames / sizeof kNames[0] == kKinds, "one name per kind of call");
   return kNames[static_cast<int>(call)];
@@ -140,7 +140,8 @@ std::vector<int> plausibleErrors(sys::Call call) {
     case Call::Malloc:
     case Call::Calloc: return {ENOMEM};
     case Call::Dup: return {EMFILE};
-    case Call::Lseek: return {EIO};
+    case Call::Lseek:
+    case Call::Sendfile: return {EIO};
     case Call::Count: break;
   }
   return {};
@@ -149,7 +150,7 @@ std::vector<int> plausibleErrors(sys::Call call) {
 bool restartedAfterInterrupt(sys::Call call) {
   using sys::Call;
   return call == Call::Open || call == Call::Read || call == Call::Write || call == Call::Pread ||
-         call == Call::Pwrite || call == Call::Truncate || call == Call::Ftruncate;
+         call == Call::Pwrite || call == Call::Sendfile || call == Call::Truncate || call == Call::Ftruncate;
 }
 
 void FaultWindow::open() {

@@ -32,7 +32,7 @@ using ::testing::MatchesRegex;
 namespace {
 
 const std::string kPrefix = "Libraries/CompressData/Decompress:[0-9]+: ";
-constexpr int64_t kPiece = 131072;
+constexpr int64_t kPiece = kDecompressPieceSize;
 constexpr uid_t kNobody = 65534;
 constexpr gid_t kNoGroup = 65534;
 
@@ -389,28 +389,25 @@ TEST_F(Decompress, FailingWriterStopsTheData) {
 // Fork position of the chunk count of a type-4 file.
 constexpr uint32_t kChunkCountPosition = 260;
 
-TEST_F(Decompress, ReadingAForkCostsAboutOneAttributeReadPerChunk) {
-  // 40 chunks in 20 pieces. Each platform read of the fork is one Linux read of its index
-  // record, plus the segments it touches that are not among the two read last. Per piece the
-  // chunk count and the table entries of its chunks take one platform read each, and each
-  // chunk one more (the first piece takes fewer: one read from the count on holds its table
-  // and chunks); reading the entries one by one would add one per chunk past the first.
+TEST_F(Decompress, ReadingAForkReadsItsIndexOnceAndEachSegmentAboutOnce) {
+  // 40 chunks of a segmented fork, in 3 pieces. The first read of the fork looks for it as a
+  // plain attribute, then reads its index record; later reads keep that index. Every data
+  // segment is read once, and the first one (count, table) again for each later piece; a
+  // segment that two pieces share may be read twice.
   const size_t chunks = 40;
   std::string path = compressedFile("many-chunks", chunks * 65536, 4);
   std::string expected = logText(chunks * 65536, 1);
   ssize_t forkSize = platform::getxattr(path.c_str(), kResourceForkXattrName, nullptr, 0, 0, 0);
-  ASSERT_GT(forkSize, 65536);
+  ASSERT_GT(forkSize, 4 * 65536);
   uint64_t before = sys::callCount(sys::Call::Fgetxattr);
   Recorder recorder;
   ASSERT_EQ(decompressTo(path, &recorder), 0);
   uint64_t calls = sys::callCount(sys::Call::Fgetxattr) - before;
   EXPECT_TRUE(recorder.bytes == expected);
-  const uint64_t pieces = chunks / 2;
-  const uint64_t indexReads = 2 * pieces + chunks;
-  // Every data segment once, and the first segment (count, table) again for each piece.
-  const uint64_t segmentReads = static_cast<uint64_t>(forkSize + 65535) / 65536 + pieces;
-  // The header, and the one look for the fork as a plain attribute.
-  EXPECT_LE(calls, indexReads + segmentReads + 2) << "Linux attribute reads for " << chunks << " chunks";
+  const uint64_t pieces = (chunks * 65536 + kPiece - 1) / kPiece;
+  const uint64_t segmentReads = static_cast<uint64_t>(forkSize + 65535) / 65536 + 2 * (pieces - 1);
+  // The header, the look for a plain fork, the index.
+  EXPECT_LE(calls, segmentReads + 3) << "Linux attribute reads for " << chunks << " chunks";
 }
 
 TEST_F(Decompress, DataThatEndsEarlyEndsTheLoopWithFailure) {
@@ -719,6 +716,35 @@ TEST_F(Decompress, CatFileWritesTheLogicalBytes) {
   EXPECT_EQ(flagsOf(type4), kFlagCompressed) << "catFile changes nothing";
 }
 
+TEST_F(Decompress, CatFileOfAPlainFileLosesNothingWhereTheKernelCopyFails) {
+  std::string expected = logText(3 * 1048576 + 5, 7);
+  std::string plain = writeFile(dir.file("plain"), expected);
+  // Standard output refusing the kernel's copy at once (as a terminal does), failing after the
+  // first call, or failing at the end of the file: the reads take over where it stopped.
+  for (uint64_t nth : {1, 2, 3}) {
+    sys::armFault(sys::Call::Sendfile, nth, nth == 1 ? EINVAL : EIO);
+    std::string printed;
+    std::string written = catOutput(plain, &printed);
+    sys::clearFaults();
+    EXPECT_EQ(written.size(), expected.size()) << nth;
+    EXPECT_TRUE(written == expected) << nth;
+    EXPECT_EQ(printed, "") << nth;
+  }
+  // Standard output open for appending takes no kernel copy.
+  std::string target = dir.file("appended");
+  int out = open(target.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
+  ASSERT_GE(out, 0);
+  fflush(stdout);
+  int saved = dup(1);
+  dup2(out, 1);
+  catFile(plain.c_str(), 0);
+  dup2(saved, 1);
+  close(saved);
+  close(out);
+  std::vector<uint8_t> appended = readFile(target);
+  EXPECT_TRUE(std::string(appended.begin(), appended.end()) == expected);
+}
+
 TEST_F(Decompress, CatFileReportsWhatItCouldNotDo) {
   std::string plain = writeFile(dir.file("plain"), logText(300000, 4));
   std::string compressed = compressedFile("compressed", 300000, 4);
@@ -735,7 +761,7 @@ TEST_F(Decompress, CatFileReportsWhatItCouldNotDo) {
       {missing, sys::Call::Count, 0, kPrefix + "stat\\(" + escaped(missing) + "\\): No such file or directory\n", 0},
       {plain, sys::Call::Open, EACCES, kPrefix + "open\\(" + escaped(plain) + "\\): Permission denied\n", 0},
       {plain, sys::Call::Read, EIO,
-       kPrefix + "read: Input/output error\n" + kPrefix + "Error: didn't read all of '" + escaped(plain) + "'\n", 131072},
+       kPrefix + "read: Input/output error\n" + kPrefix + "Error: didn't read all of '" + escaped(plain) + "'\n", kPiece},
       {compressed, sys::Call::Open, EACCES,
        "(.|\n)*" + kPrefix + "Error: Failed to open compressed file at path '" + escaped(compressed) +
            "': Permission denied \\(13\\)\n",
@@ -746,7 +772,9 @@ TEST_F(Decompress, CatFileReportsWhatItCouldNotDo) {
        0},
   };
   for (const auto &c : cases) {
-    // The plain copy reads in 128 KiB blocks: the second read fails after one block.
+    // A plain file is read in blocks when the kernel's copy fails: here at once, and then the
+    // second read, after one block.
+    if (c.call == sys::Call::Read) sys::armFault(sys::Call::Sendfile, 1, EIO);
     if (c.call != sys::Call::Count) sys::armFault(c.call, c.call == sys::Call::Read ? 2 : 1, c.error);
     std::string printed;
     std::string written = catOutput(c.path, &printed);
