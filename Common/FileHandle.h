@@ -1,7 +1,8 @@
 // The file handle: one record with a table of operations, through which the library reads
 // and writes every file's data and attributes.
 //
-// Three kinds fill it in: plain files on disk (Common/PlainFile), data pools and overlays.
+// Four kinds fill it in: plain files on disk (Common/PlainFile), attribute readers by path
+// (Common/PathAttributes), data pools and overlays.
 // Callers reach an operation through its slot, handle first (`fh->pread(fh, buf, n, off)`), and
 // call only the slots the kind implements: a kind leaves the slots it lacks null, and the unread
 // family is used only when `canUnread` is non-zero.
@@ -70,6 +71,14 @@ struct FileHandle {
 // oflag (0 read only, 2 read and write). Returns the handle, or NULL with errno set after
 // "open %s: %s". The caller closes it with fh->close(fh).
 FileHandle *openFile(const char *name, const char *path, int oflag);
+
+// A handle on the attributes of the file at path (Common/PathAttributes), for a reader that
+// needs nothing else: reading a compressed file's data takes only its attributes, and this
+// spares it opening and closing the file. Only getxattr and close are set. Each call reaches
+// the file through its path anew (following symbolic links), so a file renamed over path
+// between two calls is read from then on, as a file opened anew would be. Returns the handle,
+// or NULL (ENOMEM) after a message.
+FileHandle *openAttributeReader(const char *name, const char *path);
 
 #ifdef __cplusplus
 }

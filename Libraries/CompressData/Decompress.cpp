@@ -290,7 +290,8 @@ int catFileStatus(const char *path, int forceUserSpace) {
 
 int catFileStatusOf(const char *path, const platform::Stat &st, int forceUserSpace) {
   if ((st.st_flags & kCompressedFlag) && (!osSupportsDecmpfs() || forceUserSpace)) {
-    FileHandle *fh = openFile(path, path, O_RDONLY);
+    // The data is in the attributes alone: read through the path, the file is never opened.
+    FileHandle *fh = openAttributeReader(path, path);
     if (!fh) {
       PLZC_ERR("%s:%d: Error: Failed to open compressed file at path '%s': %s (%d)\n", path, strerror(errno), errno);
       return -1;

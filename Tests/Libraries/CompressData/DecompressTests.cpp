@@ -708,10 +708,14 @@ TEST_F(Decompress, CatFileWritesTheLogicalBytes) {
   } cases[] = {{plain, logText(10001, 4)}, {empty, ""}, {type3, logText(6000, 5)}, {type4, logText(300001, 6)}};
   for (const auto &c : cases) {
     std::string printed;
+    uint64_t opens = sys::callCount(sys::Call::Open);
     std::string written = catOutput(c.path, &printed);
     EXPECT_EQ(written.size(), c.expected.size()) << c.path;
     EXPECT_TRUE(written == c.expected) << c.path;
     EXPECT_EQ(printed, "") << c.path;
+    if (c.path == type3 || c.path == type4) {
+      EXPECT_EQ(sys::callCount(sys::Call::Open), opens) << c.path << ": read through its attributes alone";
+    }
   }
   EXPECT_EQ(flagsOf(type4), kFlagCompressed) << "catFile changes nothing";
 }
@@ -751,31 +755,38 @@ TEST_F(Decompress, CatFileReportsWhatItCouldNotDo) {
   std::string damaged = compressedFile("damaged", 300000, 4);
   setHeader(damaged, 5, 300000);
   std::string missing = dir.file("missing");
+  // A compressed file's attributes are read through its path: the first getxattr of a run
+  // reads its flags (stat), the second its header.
   struct {
     std::string path;
     sys::Call call;
+    uint64_t nth;
     int error;
     std::string message;
     size_t written;
   } cases[] = {
-      {missing, sys::Call::Count, 0, kPrefix + "stat\\(" + escaped(missing) + "\\): No such file or directory\n", 0},
-      {plain, sys::Call::Open, EACCES, kPrefix + "open\\(" + escaped(plain) + "\\): Permission denied\n", 0},
-      {plain, sys::Call::Read, EIO,
+      {missing, sys::Call::Count, 0, 0, kPrefix + "stat\\(" + escaped(missing) + "\\): No such file or directory\n", 0},
+      {plain, sys::Call::Open, 1, EACCES, kPrefix + "open\\(" + escaped(plain) + "\\): Permission denied\n", 0},
+      {plain, sys::Call::Read, 2, EIO,
        kPrefix + "read: Input/output error\n" + kPrefix + "Error: didn't read all of '" + escaped(plain) + "'\n", kPiece},
-      {compressed, sys::Call::Open, EACCES,
-       "(.|\n)*" + kPrefix + "Error: Failed to open compressed file at path '" + escaped(compressed) +
+      {compressed, sys::Call::Getxattr, 2, EACCES,
+       "(.|\n)*" + kPrefix + "Error: Failed to decompress data for file at path '" + escaped(compressed) +
            "': Permission denied \\(13\\)\n",
        0},
-      {damaged, sys::Call::Count, 0,
+      {compressed, sys::Call::Malloc, 1, ENOMEM,
+       "(.|\n)*" + kPrefix + "Error: Failed to open compressed file at path '" + escaped(compressed) +
+           "': Cannot allocate memory \\(12\\)\n",
+       0},
+      {damaged, sys::Call::Count, 0, 0,
        kPrefix + "Error: invalid compressor type 5\n" + kPrefix + "Error: Failed to decompress data for file at path '" +
            escaped(damaged) + "': [^\n]*\n",
        0},
   };
   for (const auto &c : cases) {
     // A plain file is read in blocks when the kernel's copy fails: here at once, and then the
-    // second read, after one block.
+    // second read fails, after one block.
     if (c.call == sys::Call::Read) sys::armFault(sys::Call::Sendfile, 1, EIO);
-    if (c.call != sys::Call::Count) sys::armFault(c.call, c.call == sys::Call::Read ? 2 : 1, c.error);
+    if (c.call != sys::Call::Count) sys::armFault(c.call, c.nth, c.error);
     std::string printed;
     std::string written = catOutput(c.path, &printed);
     sys::clearFaults();
