@@ -350,17 +350,20 @@ bool readPlain(const Target &target, const Names &names, std::vector<uint8_t> *v
   }
 }
 
-// The state behind an XattrReadCache: the last two segments read, and the value last found
-// segmented with its index (neither its plain form nor its index is read again).
+// The state behind an XattrReadCache: the three segments used last, and the value last found
+// segmented with its index (neither its plain form nor its index is read again). Three, because
+// a reader going through a fork in pieces comes back to the first segment (chunk count, table)
+// for every piece while its chunks go from one segment to the next.
 struct ReadCacheState {
   struct Slot {
     std::string key;
     std::unique_ptr<uint8_t[]> bytes;
     ssize_t length = 0;
     uint64_t epoch = 0;
+    uint64_t lastUse = 0;
   };
-  Slot slots[2];
-  int next = 0;
+  Slot slots[3];
+  uint64_t uses = 0;
   std::string segmentedValue;
   uint64_t segmentedEpoch = 0;
   Index segmentedIndex{};
@@ -379,14 +382,17 @@ ssize_t readSegmentForCopy(const Target &target, const Names &names, uint32_t ge
   }
   std::string key = target.identity() + '\n' + names.segment(generation, number);
   uint64_t epoch = gWriteEpoch.load(std::memory_order_relaxed);
+  ReadCacheState::Slot *leastRecent = &cache->slots[0];
   for (ReadCacheState::Slot &slot : cache->slots) {
     if (slot.bytes && slot.epoch == epoch && slot.key == key) {
+      slot.lastUse = ++cache->uses;
       *bytes = slot.bytes.get();
       return slot.length;
     }
+    if (slot.lastUse < leastRecent->lastUse) leastRecent = &slot;
   }
-  ReadCacheState::Slot &slot = cache->slots[cache->next];
-  cache->next ^= 1;
+  ReadCacheState::Slot &slot = *leastRecent;
+  slot.lastUse = ++cache->uses;
   if (!slot.bytes) slot.bytes.reset(new uint8_t[kLargestSegment]);
   slot.key.clear();
   ssize_t got = readSegment(target, names, generation, number, slot.bytes.get(), segmentSize);
