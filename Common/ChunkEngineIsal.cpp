@@ -44,7 +44,9 @@ class IsalChunkEncoder final : public ChunkEncoder {
       *code = Z_OK;
       return Result::NoFit;
     }
-    isal_zstream stream;
+    // Zeroed first: the init leaves some of the stream's state unset, and igzip reads it, so
+    // whatever the stack held before could change the stream made from the same bytes.
+    isal_zstream stream{};
     isal_deflate_stateless_init(&stream);
     stream.level = static_cast<uint32_t>(level_);
     stream.level_buf = levelBuffer_.get();

@@ -10,6 +10,7 @@ packages=(
   libdeflate-dev libisal-dev                     # the faster chunk engines
   attr e2fsprogs util-linux mount                # getfattr, mkfs.ext4, loop mounts in tests
   clang libclang-rt-14-dev llvm-14               # fuzz targets: libFuzzer, sanitizer runtimes, symbolizer
+  valgrind                                       # memcheck of the engines and plzc (Tests/memcheck.sh)
   libfuse3-dev fuse3 rsync                       # plzc mount, and copying out of it in tests
 )
 
