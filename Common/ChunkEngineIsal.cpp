@@ -44,8 +44,8 @@ class IsalChunkEncoder final : public ChunkEncoder {
       *code = Z_OK;
       return Result::NoFit;
     }
-    // Zeroed first: the init leaves some of the stream's state unset, and igzip reads it, so
-    // whatever the stack held before could change the stream made from the same bytes.
+    // Zeroed first: the stateless init leaves hist_bits unset, and igzip sizes its match window
+    // from it, so whatever the stack held could change the stream made from the same bytes.
     isal_zstream stream{};
     isal_deflate_stateless_init(&stream);
     stream.level = static_cast<uint32_t>(level_);
