@@ -176,6 +176,12 @@ class FakeDevice {
     ASSERT_GE(peer, 0) << "the handler never connected";
     shutdown(peer, SHUT_WR);
   }
+  // Our end goes away altogether: the loop reads end of file, and a write to the device fails.
+  void goAway() {
+    int peer = connectedPeer();
+    ASSERT_GE(peer, 0) << "the handler never connected";
+    shutdown(peer, SHUT_RDWR);
+  }
 
   // The next packet the library wrote, or nothing after the timeout.
   std::optional<std::vector<uint8_t>> nextPacket(std::chrono::milliseconds timeout) {
@@ -641,6 +647,37 @@ TEST_F(Type5HandlerTest, FailedAnswerIsLoggedAndTheLoopGoesOn) {
   endLoop(device);
   EXPECT_EQ(loggedLines(), errors({"send response: Input/output error", "send response: No space left on device",
                           "unknown request type 3\n"}));
+}
+
+TEST_F(Type5HandlerTest, AnswerToADeviceThatWentAwayFailsWithoutEndingTheProcess) {
+  FakeDevice &device = freshDevice();
+  std::mutex mutex;
+  Type5Completion *kept = nullptr;
+  gHandlers.type1 = [&](uint64_t, uint64_t, uint64_t, uint64_t, Type5Completion *c) {
+    std::lock_guard lock(mutex);
+    kept = Type5CompletionCopy(c);
+  };
+  device.serve();
+  device.send(makeRequest(0xE, 1, 1, 2, 3, 4));
+  Record next = makeRequest(0xF, 2);
+  device.send(next);
+  EXPECT_EQ(device.nextRecord(), next);
+  device.goAway();
+  EXPECT_EQ(device.loopResult(), std::optional<int>(0));
+  Type5Completion *completion;
+  {
+    std::lock_guard lock(mutex);
+    completion = kept;
+  }
+  ASSERT_NE(completion, nullptr);
+  // A sequenced-packet socket whose other side is gone fails the write with EPIPE and raises no
+  // SIGPIPE (which would end the host process); a FIFO is opened for reading too, so it always
+  // has a reader.
+  errno = 0;
+  EXPECT_EQ(Type5CompletionInvoke(completion, 1, 2, 3), -1);
+  EXPECT_EQ(errno, EPIPE);
+  Type5CompletionRelease(completion);
+  EXPECT_EQ(loggedLines(), errors({"read request: Success", "unknown request type 0\n", "send response: Broken pipe"}));
 }
 
 TEST_F(Type5HandlerTest, DeviceThatCannotBeOpenedIsLogged) {
