@@ -9,6 +9,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <sstream>
 
 #include "Common/ChunkEngine.h"
 #include "Console.h"
@@ -68,6 +69,39 @@ int chooseJobs(const char *command, const char *text, int *jobs) {
   if (!parseNumber(text, 1, 1024, &number))
     return usageError(command, std::string("invalid number of jobs '") + text + "': give 1 to 1024");
   *jobs = static_cast<int>(number);
+  return kExitSuccess;
+}
+
+namespace {
+
+bool validTypeList(const std::string &list) {
+  std::stringstream tokens(list);
+  std::string token;
+  bool seen[5] = {};
+  int count = 0;
+  while (std::getline(tokens, token, ',')) {
+    if (token != "3" && token != "4") return false;
+    int type = token[0] - '0';
+    if (seen[type]) return false;
+    seen[type] = true;
+    count++;
+  }
+  return count > 0 && list.back() != ',';
+}
+
+}  // namespace
+
+int chooseTypes(const char *command, const char *text, std::string *types) {
+  if (!validTypeList(text))
+    return usageError(command,
+                      std::string("invalid type list '") + text + "': give 3, 4, or both separated by a comma");
+  *types = text;
+  return kExitSuccess;
+}
+
+int chooseLevel(const char *command, const char *text, long *level) {
+  if (!parseNumber(text, 1, 9, level))
+    return usageError(command, std::string("invalid level '") + text + "': give 1 to 9");
   return kExitSuccess;
 }
 

@@ -46,6 +46,13 @@ bool parseNumber(const char *text, long min, long max, long *out);
 // set, or kExitUsage after saying what was wrong.
 int chooseJobs(const char *command, const char *text, int *jobs);
 
+// -t LIST: the compression types tried, "3", "4", "3,4" or "4,3" (each type at most once).
+// Returns kExitSuccess with *types set, or kExitUsage after saying what was wrong.
+int chooseTypes(const char *command, const char *text, std::string *types);
+// -l N: the compression level, 1 to 9. Returns kExitSuccess with *level set, or kExitUsage
+// after saying what was wrong.
+int chooseLevel(const char *command, const char *text, long *level);
+
 // --engine NAME: makes NAME ("zlib", "libdeflate", "isal") the chunk engine of this run.
 // Returns kExitSuccess, or kExitUsage after saying what was wrong (not an engine, or not built
 // into this plzc).

@@ -68,14 +68,10 @@ int compressCommand(int argc, char **argv) {
   for (int c; (c = nextOption(command, argc, argv, "t:l:j:vh", kOptions)) != -1;) {
     switch (c) {
       case 't':
-        if (!validTypeList(optarg))
-          return usageError(command, std::string("invalid type list '") + optarg +
-                                         "': give 3, 4, or both separated by a comma");
-        options.types = optarg;
+        if (chooseTypes(command, optarg, &options.types) != kExitSuccess) return kExitUsage;
         break;
       case 'l':
-        if (!parseNumber(optarg, 1, 9, &number))
-          return usageError(command, std::string("invalid level '") + optarg + "': give 1 to 9");
+        if (chooseLevel(command, optarg, &number) != kExitSuccess) return kExitUsage;
         options.level = static_cast<int>(number);
         break;
       case 'j':

@@ -8,7 +8,6 @@
 #include <memory>
 #include <cstdarg>
 #include <mutex>
-#include <sstream>
 
 #include "Cli.h"
 #include "FileWalk.h"
@@ -214,21 +213,6 @@ bool addTocTotals(const std::string &tocPath, Totals *totals) {
 }
 
 }  // namespace
-
-bool validTypeList(const std::string &list) {
-  std::stringstream tokens(list);
-  std::string token;
-  bool seen[5] = {};
-  int count = 0;
-  while (std::getline(tokens, token, ',')) {
-    if (token != "3" && token != "4") return false;
-    int type = token[0] - '0';
-    if (seen[type]) return false;
-    seen[type] = true;
-    count++;
-  }
-  return count > 0 && list.back() != ',';
-}
 
 CompressResult runCompress(const CompressOptions &options, const std::vector<std::string> &paths, Console &console,
                            const char *progressLabel) {

@@ -28,10 +28,6 @@ struct CompressResult {
   bool setupFailed = false;   // nothing was compressed: the context could not be made
 };
 
-// "3,4", "4", "4,3", "3": a comma-separated list of the types that compress (3 and 4), each at
-// most once. False for anything else.
-bool validTypeList(const std::string &list);
-
 // Compresses every regular file named by paths or found under them. Each failure is reported
 // on the console ("plzc: PATH: cause"); with the console's verbose flag every file gets a line
 // on standard error. Files that do not shrink, are empty or already compressed are left as

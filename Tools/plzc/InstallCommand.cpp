@@ -109,15 +109,10 @@ int installCommand(int argc, char **argv) {
         choices.optionsFile = optarg;
         break;
       case 't':
-        if (!validTypeList(optarg))
-          return usageError(command, std::string("invalid type list '") + optarg +
-                                         "': give 3, 4, or both separated by a comma");
-        choices.types = optarg;
+        if (chooseTypes(command, optarg, &choices.types) != kExitSuccess) return kExitUsage;
         break;
       case 'l':
-        if (!parseNumber(optarg, 1, 9, &number))
-          return usageError(command, std::string("invalid level '") + optarg + "': give 1 to 9");
-        choices.level = number;
+        if (chooseLevel(command, optarg, &choices.level) != kExitSuccess) return kExitUsage;
         break;
       case kRules:
         if (!*optarg) return usageError(command, "--rules needs a file name");
