@@ -113,6 +113,26 @@ int onType2(uint64_t value1, uint64_t value2) {
 
 constexpr Type5Callbacks kCallbacks = {onType1, onType2};
 
+// Keeps a copy of the completion of each type-1 request (the last one wins) for the test to
+// answer later.
+class KeptCompletion {
+ public:
+  KeptCompletion() {
+    gHandlers.type1 = [this](uint64_t, uint64_t, uint64_t, uint64_t, Type5Completion *c) {
+      std::lock_guard lock(mutex_);
+      kept_ = Type5CompletionCopy(c);
+    };
+  }
+  Type5Completion *take() {
+    std::lock_guard lock(mutex_);
+    return std::exchange(kept_, nullptr);
+  }
+
+ private:
+  std::mutex mutex_;
+  Type5Completion *kept_ = nullptr;
+};
+
 // ---- The device's side ----------------------------------------------------------------------
 
 // A sequenced-packet socket listening at a path. serve() runs type5_handler_function on its own
@@ -615,12 +635,7 @@ TEST_F(Type5HandlerTest, ShortRequestIsServedAsFarAsItFilledAFreshRecord) {
 
 TEST_F(Type5HandlerTest, FailedAnswerIsLoggedAndTheLoopGoesOn) {
   FakeDevice &device = freshDevice();
-  std::mutex mutex;
-  Type5Completion *kept = nullptr;
-  gHandlers.type1 = [&](uint64_t, uint64_t, uint64_t, uint64_t, Type5Completion *c) {
-    std::lock_guard lock(mutex);
-    kept = Type5CompletionCopy(c);
-  };
+  KeptCompletion kept;
   device.serve();
   sys::armFault(sys::Call::Write, 1, EIO);
   device.send(makeRequest(0xA, 2, 1, 2, 3, 4));
@@ -631,11 +646,7 @@ TEST_F(Type5HandlerTest, FailedAnswerIsLoggedAndTheLoopGoesOn) {
   device.send(makeRequest(0xC, 1, 1, 2, 3, 0xC4));
   device.send(next);
   EXPECT_EQ(device.nextRecord(), next);
-  Type5Completion *completion;
-  {
-    std::lock_guard lock(mutex);
-    completion = kept;
-  }
+  Type5Completion *completion = kept.take();
   ASSERT_NE(completion, nullptr);
   sys::armFault(sys::Call::Write, 1, ENOSPC);
   errno = 0;
@@ -651,12 +662,7 @@ TEST_F(Type5HandlerTest, FailedAnswerIsLoggedAndTheLoopGoesOn) {
 
 TEST_F(Type5HandlerTest, AnswerToADeviceThatWentAwayFailsWithoutEndingTheProcess) {
   FakeDevice &device = freshDevice();
-  std::mutex mutex;
-  Type5Completion *kept = nullptr;
-  gHandlers.type1 = [&](uint64_t, uint64_t, uint64_t, uint64_t, Type5Completion *c) {
-    std::lock_guard lock(mutex);
-    kept = Type5CompletionCopy(c);
-  };
+  KeptCompletion kept;
   device.serve();
   device.send(makeRequest(0xE, 1, 1, 2, 3, 4));
   Record next = makeRequest(0xF, 2);
@@ -664,11 +670,7 @@ TEST_F(Type5HandlerTest, AnswerToADeviceThatWentAwayFailsWithoutEndingTheProcess
   EXPECT_EQ(device.nextRecord(), next);
   device.goAway();
   EXPECT_EQ(device.loopResult(), std::optional<int>(0));
-  Type5Completion *completion;
-  {
-    std::lock_guard lock(mutex);
-    completion = kept;
-  }
+  Type5Completion *completion = kept.take();
   ASSERT_NE(completion, nullptr);
   // A sequenced-packet socket whose other side is gone fails the write with EPIPE and raises no
   // SIGPIPE (which would end the host process); a FIFO is opened for reading too, so it always

@@ -18,7 +18,6 @@
 #include "Platform/ExtendedAttributes.h"
 #include "Platform/FileFlags.h"
 #include "Plenzo.h"
-#include "Progress.h"
 #include "StoredForm.h"
 
 namespace plzc {
@@ -166,18 +165,11 @@ int decompressCommand(int argc, char **argv) {
   installInterruptHandler();
   Console console(verbose, progressWanted);
   DecompressTotals totals;
-  WalkResult walked;
   double seconds;
-  {
-    ProgressMeter progress(console, "plzc decompress");
-    walked = forEachFile(
-        paths, WalkOptions{}, jobs,
-        [&](const WalkedFile &file) {
-          progress.fileDone(decompressOne(file.path.c_str(), verify, userSpace, console, totals));
-        },
-        [&](uint64_t files) { progress.setTotalFiles(files); });
-    seconds = progress.elapsedSeconds();
-  }
+  WalkResult walked = walkWithProgress(
+      console, "plzc decompress", paths, jobs,
+      [&](const WalkedFile &file) { return decompressOne(file.path.c_str(), verify, userSpace, console, totals); },
+      &seconds);
   uint64_t failed = totals.failed + static_cast<uint64_t>(walked.failures);
   if (verbose)
     console.err(

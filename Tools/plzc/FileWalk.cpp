@@ -14,6 +14,7 @@
 #include "Console.h"
 #include "Libraries/CompressData/FileEnumerator.h"
 #include "Plenzo.h"
+#include "Progress.h"
 
 namespace plzc {
 
@@ -156,6 +157,16 @@ WalkResult forEachFile(const std::vector<std::string> &arguments, const WalkOpti
   for (std::thread &worker : workers) worker.join();
   result.interrupted = interrupted();
   return result;
+}
+
+WalkResult walkWithProgress(Console &console, const char *label, const std::vector<std::string> &arguments, int jobs,
+                            const std::function<uint64_t(const WalkedFile &)> &work, double *seconds) {
+  ProgressMeter progress(console, label);
+  WalkResult walked = forEachFile(
+      arguments, WalkOptions{}, jobs, [&](const WalkedFile &file) { progress.fileDone(work(file)); },
+      [&](uint64_t files) { progress.setTotalFiles(files); });
+  *seconds = progress.elapsedSeconds();
+  return walked;
 }
 
 }  // namespace plzc

@@ -44,4 +44,12 @@ WalkResult forEachFile(const std::vector<std::string> &arguments, const WalkOpti
                        const std::function<void(const WalkedFile &)> &work,
                        const std::function<void(uint64_t files)> &walkDone = {});
 
+class Console;
+
+// forEachFile over the arguments (default options) under a progress meter labelled `label`
+// on the console: work(file) does one file and returns the bytes the meter counts for it.
+// *seconds gets how long the whole walk took.
+WalkResult walkWithProgress(Console &console, const char *label, const std::vector<std::string> &arguments, int jobs,
+                            const std::function<uint64_t(const WalkedFile &)> &work, double *seconds);
+
 }  // namespace plzc

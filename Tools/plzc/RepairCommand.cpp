@@ -10,7 +10,6 @@
 #include "FileWalk.h"
 #include "Installer.h"
 #include "Libraries/CompressData/Repair.h"
-#include "Progress.h"
 
 namespace plzc {
 
@@ -108,19 +107,14 @@ int repairCommand(int argc, char **argv) {
   installInterruptHandler();
   Console console(verbose, progressWanted);
   RepairTotals totals;
-  WalkResult walked;
   double seconds;
-  {
-    ProgressMeter progress(console, "plzc repair");
-    walked = forEachFile(
-        paths, WalkOptions{}, jobs,
-        [&](const WalkedFile &file) {
-          repairOne(file.path, dryRun, console, totals);
-          progress.fileDone(file.size);
-        },
-        [&](uint64_t files) { progress.setTotalFiles(files); });
-    seconds = progress.elapsedSeconds();
-  }
+  WalkResult walked = walkWithProgress(
+      console, "plzc repair", paths, jobs,
+      [&](const WalkedFile &file) {
+        repairOne(file.path, dryRun, console, totals);
+        return file.size;
+      },
+      &seconds);
   uint64_t failed = totals.failed + static_cast<uint64_t>(walked.failures);
   console.out("plzc repair: %llu files in %.2f s: %llu clean, %llu %s, %llu left alone, %llu failed",
               static_cast<unsigned long long>(totals.files.load()), seconds,
