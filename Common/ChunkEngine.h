@@ -4,7 +4,8 @@
 // (header, deflate data, Adler-32), and every engine reads what any other wrote. They differ
 // only in speed and, slightly, in how small they make a chunk at a given level. zlib is the
 // reference engine and is always built; libdeflate (the default) and ISA-L igzip (the fast
-// engine) are built unless the build turns the optional engines off.
+// engine) are built unless the build turns the optional engines off. The ISA-L engine decodes
+// through libdeflate: igzip's inflate accepts some damaged streams that zlib refuses.
 //
 // The engine of a process is PLZC_ENGINE ("zlib", "libdeflate" or "isal") when set and built,
 // else the build's default; setChunkEngine() overrides both (the tool's --engine, tests).

@@ -223,6 +223,24 @@ TEST_P(ChunkEngines, PiecewiseDecodingAndDamageMatchZlib) {
   EXPECT_EQ(code, Z_DATA_ERROR);
 }
 
+// A stream that igzip's inflate decodes (to 131,072 zero bytes) but that zlib refuses at its
+// first block, whose distance code set is incomplete ("invalid distances set"): every engine
+// refuses it as zlib does, with a chunk size that would hold the whole output.
+TEST_P(ChunkEngines, StreamZlibRefusesIsRefusedByEveryEngine) {
+  Bytes stream = {0x78, 0x5e, 0xed, 0xc1, 0x81, 0x00, 0x00, 0x00, 0x00, 0x80, 0xa0, 0xfd, 0xa9, 0x17, 0xa9, 0x03};
+  stream.resize(142, 0);
+  stream.insert(stream.end(), {0xa8, 0xaa, 0x06, 0x00, 0x1e, 0x00, 0x01});
+  constexpr uint32_t kWhole = 131072;
+  std::unique_ptr<ChunkDecoder> decoder = ChunkDecoder::create(GetParam(), kWhole);
+  decoder->begin(stream.data(), static_cast<uint32_t>(stream.size()));
+  Bytes out(kWhole);
+  uint32_t produced = 0;
+  int code = Z_OK;
+  EXPECT_FALSE(decoder->decodeInto(out.data(), kWhole, &produced, &code));
+  EXPECT_EQ(code, Z_DATA_ERROR);
+  EXPECT_EQ(produced, 0u);
+}
+
 // A space far smaller than the input (the small-file form) is judged as compressing the whole
 // input would judge it, also when the start of the input compresses badly and the rest well.
 TEST_P(ChunkEngines, SmallSpaceFitsExactlyWhenTheWholeStreamFits) {
