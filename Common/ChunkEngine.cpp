@@ -317,15 +317,20 @@ std::unique_ptr<ChunkEncoder> ChunkEncoder::create(ChunkEngine engine, int level
   }
 }
 
+#if PLZC_HAVE_ISAL && !PLZC_HAVE_LIBDEFLATE
+#error "the isal engine decodes through libdeflate"
+#endif
+
 std::unique_ptr<ChunkDecoder> ChunkDecoder::create(ChunkEngine engine, uint32_t chunkSize) {
   switch (engine) {
 #if PLZC_HAVE_LIBDEFLATE
+    // igzip's inflate accepts streams that zlib refuses: a dynamic block whose distance code set
+    // is incomplete decodes under igzip and fails under zlib ("invalid distances set"), so a
+    // damaged chunk would read back under the isal engine where zlib reports it. That engine
+    // therefore decodes through libdeflate, whose outcomes are zlib's; igzip only compresses.
+    case ChunkEngine::Isal:
     case ChunkEngine::Libdeflate:
       return makeLibdeflateChunkDecoder(chunkSize);
-#endif
-#if PLZC_HAVE_ISAL
-    case ChunkEngine::Isal:
-      return makeIsalChunkDecoder(chunkSize);
 #endif
     default:
       return makeZlibChunkDecoder();

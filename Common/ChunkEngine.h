@@ -146,5 +146,4 @@ std::unique_ptr<ChunkDecoder> makeLibdeflateChunkDecoder(uint32_t chunkSize);
 #endif
 #if PLZC_HAVE_ISAL
 std::unique_ptr<ChunkEncoder> makeIsalChunkEncoder(int level);
-std::unique_ptr<ChunkDecoder> makeIsalChunkDecoder(uint32_t chunkSize);
 #endif

@@ -1,7 +1,4 @@
 // The ISA-L igzip engine: the fastest compression, for users who want speed over size.
-#if !PLZC_HAVE_LIBDEFLATE
-#error "the isal engine decodes through libdeflate"
-#endif
 #include <isa-l/igzip_lib.h>
 #include <zlib.h>
 
@@ -86,9 +83,3 @@ class IsalChunkEncoder final : public ChunkEncoder {
 }  // namespace
 
 std::unique_ptr<ChunkEncoder> makeIsalChunkEncoder(int level) { return std::make_unique<IsalChunkEncoder>(level); }
-
-// igzip's inflate accepts streams that zlib refuses: a dynamic block whose distance code set is
-// incomplete decodes under igzip and fails under zlib ("invalid distances set"), so a damaged
-// chunk would read back under this engine where zlib reports it. This engine therefore decodes
-// through libdeflate, whose outcomes are zlib's; it only compresses with igzip.
-std::unique_ptr<ChunkDecoder> makeIsalChunkDecoder(uint32_t chunkSize) { return makeLibdeflateChunkDecoder(chunkSize); }
