@@ -34,7 +34,8 @@ pthread_cond_t totalPoolAllocsCond = PTHREAD_COND_INITIALIZER;
 int32_t compressorFdsCount = 0;
 uint64_t max_fds = 0;
 pthread_mutex_t compressorFdsLock = PTHREAD_MUTEX_INITIALIZER;
-pthread_cond_t compressorFdsCond = PTHREAD_COND_INITIALIZER;
+pthread_cond_t compressorFdsCond = PTHREAD_COND_INITIALIZER;      // the count came down
+pthread_cond_t compressorFdsClosedCond = PTHREAD_COND_INITIALIZER;  // a descriptor was closed
 pthread_once_t once_rlimit = PTHREAD_ONCE_INIT;
 std::atomic<uint32_t> tooManyFilesWaitMs{5000};
 
@@ -123,15 +124,22 @@ int32_t waitThenDupOrOpen(const char *path, int32_t fd) {
         pthread_cond_wait(&compressorFdsCond, &compressorFdsLock);
       workQueueBlockingEnd();
     }
+    // The place is taken before the descriptor exists and the lock is not held across the
+    // system call: the other threads' opens and closes do not queue up behind this one.
+    compressorFdsCount++;
+    pthread_mutex_unlock(&compressorFdsLock);
     int result = path ? sys::open(path, O_RDONLY, 0) : sys::dup(fd);
-    if (result >= 0) {
-      compressorFdsCount++;
+    if (result >= 0) return result;
+    int savedErrno = errno;
+    pthread_mutex_lock(&compressorFdsLock);
+    // The place goes back; a thread that found the count full because of it may go on. Threads
+    // waiting for a close (below) are not woken: no descriptor was freed.
+    compressorFdsCount--;
+    pthread_cond_signal(&compressorFdsCond);
+    if (savedErrno != EMFILE && savedErrno != ENFILE) {
+      PLZC_ERR("%s:%d: waitThenDupOrOpen(%s,%d): %s\n", path ? path : "(null)", fd, strerror(savedErrno));
       pthread_mutex_unlock(&compressorFdsLock);
-      return result;
-    }
-    if (errno != EMFILE && errno != ENFILE) {
-      PLZC_ERR("%s:%d: waitThenDupOrOpen(%s,%d): %s\n", path ? path : "(null)", fd, strerror(errno));
-      pthread_mutex_unlock(&compressorFdsLock);
+      errno = savedErrno;
       return -1;
     }
     struct timeval now;
@@ -142,19 +150,23 @@ int32_t waitThenDupOrOpen(const char *path, int32_t fd) {
     uint64_t deadlineUs = static_cast<uint64_t>(now.tv_usec) + tooManyFilesWaitMs.load(std::memory_order_relaxed) * 1000ull;
     struct timespec deadline = {now.tv_sec + static_cast<time_t>(deadlineUs / 1000000),
                                 static_cast<long>(deadlineUs % 1000000) * 1000};
-    pthread_cond_timedwait(&compressorFdsCond, &compressorFdsLock, &deadline);
+    // The process is out of descriptors: wait for one of ours to be closed, or a while.
+    pthread_cond_timedwait(&compressorFdsClosedCond, &compressorFdsLock, &deadline);
   }
 }
 
 int32_t closeAndSignal(int32_t fd) {
   if (fd < 1) return 0;
-  pthread_mutex_lock(&compressorFdsLock);
+  // Closed outside the lock; the place is given back after (the count is never below the
+  // descriptors that exist).
   int result = sys::close(fd);
   int savedErrno = errno;
+  pthread_mutex_lock(&compressorFdsLock);
   // Linux releases the descriptor even when close reports an error (EIO, EINTR): keeping the
   // charge would lose a place in the budget for good, and with it, one day, every opener.
   compressorFdsCount--;
   pthread_cond_signal(&compressorFdsCond);
+  pthread_cond_signal(&compressorFdsClosedCond);
   pthread_mutex_unlock(&compressorFdsLock);
   errno = savedErrno;
   return result;

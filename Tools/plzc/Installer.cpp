@@ -369,9 +369,16 @@ class Installer {
     return true;
   }
 
+  // The walk (one thread) runs ahead of the copiers by up to kQueuedPerJob files each. A full
+  // queue stops it until the copiers have taken half: one wake-up for many files, not one each
+  // (every wake-up of a thread on the other processor costs an interrupt).
+  static constexpr size_t kQueuedPerJob = 32;
+  size_t queueHigh() const { return static_cast<size_t>(jobs_) * kQueuedPerJob; }
+  size_t queueLow() const { return queueHigh() / 2; }
+
   void enqueue(FileJob job) {
     std::unique_lock<std::mutex> guard(lock_);
-    hasRoom_.wait(guard, [this] { return jobs_queue_.size() < static_cast<size_t>(jobs_) * 4; });
+    if (jobs_queue_.size() >= queueHigh()) hasRoom_.wait(guard, [this] { return jobs_queue_.size() <= queueLow(); });
     jobs_queue_.push_back(std::move(job));
     filesQueued_++;
     haveWork_.notify_one();
@@ -387,7 +394,9 @@ class Installer {
         if (jobs_queue_.empty()) return;
         job = std::move(jobs_queue_.front());
         jobs_queue_.pop_front();
-        hasRoom_.notify_one();
+        // The walk waits only on a full queue, for it to come down to queueLow(); the copiers
+        // alone take files out, so every such wait sees this size go by.
+        if (jobs_queue_.size() == queueLow()) hasRoom_.notify_one();
       }
       if (interrupted()) {
         interrupted_ = true;
