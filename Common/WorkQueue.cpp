@@ -127,14 +127,18 @@ class Pool final : public WorkQueue {
   }
 
   void submit(const Item &item) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    std::unique_lock<std::mutex> lock(mutex_);
     try {
       queue_.push_back(item);
     } catch (const std::bad_alloc &) {
       WQ_FATAL("%s:%d: Error: out of memory queuing work on %s\n", label.c_str());
     }
-    if (idle_ > 0) workAvailable_.notify_one();
+    bool wake = idle_ > 0;
     startThreadIfNeededLocked();
+    // Woken after the lock is let go, so that the idle thread does not wake only to wait for
+    // it. The submitter holds a reference, so the pool outlives this call.
+    lock.unlock();
+    if (wake) workAvailable_.notify_one();
   }
 
   // Starts the first thread before any work comes, while the process can still afford one. A
