@@ -139,7 +139,7 @@ for round in $(seq "$rounds"); do
 done
 
 echo "# $(grep -m1 'model name' /proc/cpuinfo | cut -d: -f2 | xargs), $(nproc) cores, $(uname -r), load average $(cut -d' ' -f1-3 /proc/loadavg)"
-echo "# zlib $(dpkg-query -W -f '${Version}' zlib1g 2>/dev/null), libdeflate $(dpkg-query -W -f '${Version}' libdeflate0 2>/dev/null), isa-l $(dpkg-query -W -f '${Version}' libisal2 2>/dev/null), $(mksquashfs -version 2>&1 | sed -n 1p), $("$plzc" --version)"
+echo "# $("$plzc" --version | tr '\n' ';' | sed 's/;$//; s/;/; /'), $(mksquashfs -version 2>&1 | sed -n 1p)"
 echo "# corpus: make_corpus.py --size-mb 256 --seed 1: $files files, $bytes bytes; $rounds rounds: every figure is the median of its rounds, every ratio to a peer the median of the rounds' own ratios; MB = 10^6 bytes"
 echo "# every tree compressed in place read back by libdeflate, isal and zlib through plzc cat, and by zlib's inflate alone: identical to the corpus"
 awk -F'\t' -v b="$bytes" -v rounds="$rounds" '

@@ -171,6 +171,26 @@ bool chunkEngineBuilt(ChunkEngine engine) {
   return false;
 }
 
+const char *chunkEngineVersion(ChunkEngine engine) {
+  switch (engine) {
+    case ChunkEngine::Zlib:
+      return zlibVersion();
+    case ChunkEngine::Libdeflate:
+#if PLZC_HAVE_LIBDEFLATE
+      return libdeflateVersion();
+#else
+      return "";
+#endif
+    case ChunkEngine::Isal:
+#if PLZC_HAVE_ISAL
+      return isalVersion();
+#else
+      return "";
+#endif
+  }
+  return "";
+}
+
 const char *chunkEngineName(ChunkEngine engine) {
   int index = static_cast<int>(engine);
   return index >= 0 && index < 3 ? kEngineNames[index] : "unknown";

@@ -25,6 +25,8 @@ bool setChunkEngine(ChunkEngine engine);
 bool chunkEngineBuilt(ChunkEngine engine);
 // "zlib", "libdeflate", "isal".
 const char *chunkEngineName(ChunkEngine engine);
+// The version of the library behind the engine ("1.23"), as built in; "" when not built.
+const char *chunkEngineVersion(ChunkEngine engine);
 // Parses an engine name; false for a name that is not one of the three.
 bool chunkEngineFromName(const char *name, ChunkEngine *engine);
 
@@ -143,7 +145,9 @@ std::unique_ptr<ChunkDecoder> makeZlibChunkDecoder();
 #if PLZC_HAVE_LIBDEFLATE
 std::unique_ptr<ChunkEncoder> makeLibdeflateChunkEncoder(int level);
 std::unique_ptr<ChunkDecoder> makeLibdeflateChunkDecoder(uint32_t chunkSize);
+const char *libdeflateVersion();
 #endif
 #if PLZC_HAVE_ISAL
 std::unique_ptr<ChunkEncoder> makeIsalChunkEncoder(int level);
+const char *isalVersion();
 #endif

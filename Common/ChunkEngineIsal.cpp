@@ -1,4 +1,5 @@
 // The ISA-L igzip engine: the fastest compression, for users who want speed over size.
+#include <isa-l.h>
 #include <isa-l/igzip_lib.h>
 #include <zlib.h>
 
@@ -81,5 +82,11 @@ class IsalChunkEncoder final : public ChunkEncoder {
 };
 
 }  // namespace
+
+#define PLZC_STRINGIFY2(x) #x
+#define PLZC_STRINGIFY(x) PLZC_STRINGIFY2(x)
+const char *isalVersion() {
+  return PLZC_STRINGIFY(ISAL_MAJOR_VERSION) "." PLZC_STRINGIFY(ISAL_MINOR_VERSION) "." PLZC_STRINGIFY(ISAL_PATCH_VERSION);
+}
 
 std::unique_ptr<ChunkEncoder> makeIsalChunkEncoder(int level) { return std::make_unique<IsalChunkEncoder>(level); }

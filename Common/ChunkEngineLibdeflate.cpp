@@ -143,6 +143,9 @@ class LibdeflateChunkDecoder final : public WholeChunkDecoder {
 
 }  // namespace
 
+// Linked statically (see Scripts/setup.sh): the header's version is the code's.
+const char *libdeflateVersion() { return LIBDEFLATE_VERSION_STRING; }
+
 std::unique_ptr<ChunkEncoder> makeLibdeflateChunkEncoder(int level) {
   return std::make_unique<LibdeflateChunkEncoder>(level);
 }

@@ -4,6 +4,7 @@
 #include <string>
 
 #include "Cli.h"
+#include "Common/ChunkEngine.h"
 #include "Console.h"
 #include "Platform/SystemResources.h"
 
@@ -72,6 +73,11 @@ int main(int argc, char **argv) {
   }
   if (!strcmp(word, "-V") || !strcmp(word, "--version")) {
     printf("plzc (Plenzo) %s\n", PLZC_VERSION);
+    // The chunk engines built in, with their libraries' versions.
+    printf("engines:");
+    for (ChunkEngine engine : {ChunkEngine::Zlib, ChunkEngine::Libdeflate, ChunkEngine::Isal})
+      if (chunkEngineBuilt(engine)) printf(" %s %s", chunkEngineName(engine), chunkEngineVersion(engine));
+    printf("\n");
     return plzc::kExitSuccess;
   }
   for (const Subcommand &subcommand : kSubcommands)
