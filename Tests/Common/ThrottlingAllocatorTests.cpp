@@ -148,6 +148,22 @@ TEST(ThrottlingAllocator, DescriptorBudgetRaisesTheSoftLimitAndBlocksThe59thHold
   });
 }
 
+// A place is taken before the open and given back when it fails: failed opens neither use up
+// the budget nor lose the cause.
+TEST(ThrottlingAllocator, FailedOpenGivesItsPlaceBackAndKeepsItsCause) {
+  inChild([] {
+    int fd = waitThenDupOrOpen(nullptr, 0);
+    if (fd < 0) return 1;
+    for (int i = 0; i < 3; i++) {
+      errno = 0;
+      if (waitThenDupOrOpen("/nonexistent/plenzo-budget-test", -1) != -1) return 2;
+      if (errno != ENOENT) return 3;
+    }
+    if (throttlingDescriptorsHeld() != 1) return 4;
+    return closeAndSignal(fd) == 0 && throttlingDescriptorsHeld() == 0 ? 0 : 5;
+  });
+}
+
 TEST(ThrottlingAllocator, HighSoftLimitIsLoweredAndLeavesTheSmallestBudget) {
   inChild([] {
     struct rlimit limit;
