@@ -29,12 +29,15 @@ class FileQueue {
 
   explicit FileQueue(size_t capacity) : capacity_(capacity) {}
 
-  // Waits for room; gives up (false) after an interruption.
+  // Waits for room; gives up (false) after an interruption. A full queue stops the producer (one
+  // thread) until the consumers have taken half: one wake-up for many files, not one each.
   bool push(WalkedFile file) {
     std::unique_lock<std::mutex> guard(lock_);
-    while (items_.size() >= capacity_) {
-      if (interrupted()) return false;
-      notFull_.wait_for(guard, kSignalPoll);
+    if (items_.size() >= capacity_) {
+      while (items_.size() > low()) {
+        if (interrupted()) return false;
+        notFull_.wait_for(guard, kSignalPoll);
+      }
     }
     items_.push_back(std::move(file));
     notEmpty_.notify_one();
@@ -48,7 +51,8 @@ class FileQueue {
     if (items_.empty() || interrupted()) return false;
     *file = std::move(items_.front());
     items_.pop_front();
-    notFull_.notify_one();
+    // Only consumers take items, so a producer waiting on a full queue sees this size go by.
+    if (items_.size() == low()) notFull_.notify_one();
     return true;
   }
 
@@ -59,6 +63,8 @@ class FileQueue {
   }
 
  private:
+  size_t low() const { return capacity_ / 2; }
+
   size_t capacity_;
   std::deque<WalkedFile> items_;
   bool closed_ = false;
